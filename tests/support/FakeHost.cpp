@@ -1,0 +1,313 @@
+#include "support/FakeHost.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "platform/MWPhysMemweightSwitch.h"
+
+namespace {
+
+// A task handle is the pid shifted, so that code which mixes the two up does not work by chance.
+constexpr uint32_t kTaskShift = 4;
+
+int32_t pidOfTask(task_t task) { return static_cast<int32_t>(task >> kTaskShift); }
+
+template <size_t N>
+void copyText(std::array<char, N>& to, const std::string& from) {
+    to.fill('\0');
+    std::copy_n(from.begin(), std::min(from.size(), N), to.begin());
+}
+
+int noSuchProcess() {
+    errno = ESRCH;
+    return -1;
+}
+
+class FakeImageCursor : public MWImageDescription {
+public:
+    explicit FakeImageCursor(const FakeImage& image) : _image(image) {}
+    std::string path() const override { return _image.path; }
+    uint64_t baseAddress() const override { return _image.baseAddress; }
+    void forEachSegment(const std::function<void(const MWImageSegmentDescription&)>& block) const override {
+        for (const auto& segment : _image.segments) {
+            block(segment);
+        }
+    }
+
+private:
+    const FakeImage& _image;
+};
+
+}  // namespace
+
+FakeHost::FakeHost() : _previous(MWHostInterface::setCurrent(this)) { MWPhysMemweightSwitch::set(false); }
+
+FakeHost::~FakeHost() { MWHostInterface::setCurrent(_previous); }
+
+int FakeHost::asked(const std::string& operation) const {
+    const std::lock_guard lock(_mutex);
+    const auto found = _asked.find(operation);
+    return found == _asked.end() ? 0 : found->second;
+}
+
+void FakeHost::_count(const std::string& operation) {
+    const std::lock_guard lock(_mutex);
+    _asked[operation] += 1;
+}
+
+FakeProcess* FakeHost::_find(int32_t pid) {
+    const auto found = processes.find(pid);
+    return found == processes.end() ? nullptr : &found->second;
+}
+
+const FakeRegion* FakeHost::_regionAtOrAbove(task_t task, uint64_t address) {
+    for (const auto& region : processes.at(pidOfTask(task)).regions) {
+        if (region.start + region.size > address) {
+            return &region;
+        }
+    }
+    return nullptr;
+}
+
+kern_return_t FakeHost::task_read_for_pid(int32_t pid, task_t& task) {
+    _count("task_read_for_pid");
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || process->refused) {
+        return KERN_FAILURE;
+    }
+    task = static_cast<task_t>(pid) << kTaskShift;
+    const std::lock_guard lock(_mutex);
+    openTasks.insert(task);
+    return KERN_SUCCESS;
+}
+
+void FakeHost::task_release(task_t task) {
+    const std::lock_guard lock(_mutex);
+    openTasks.erase(task);
+}
+
+bool FakeHost::hasSharedCache(task_t) { return sharedCache; }
+
+kern_return_t FakeHost::mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t&,
+                                               vm_region_submap_info_64& info, uint32_t& count) {
+    _count("mach_vm_region_recurse");
+    const FakeProcess& process = processes.at(pidOfTask(task));
+    {
+        const std::lock_guard lock(_mutex);
+        if (process.walkFailure != KERN_SUCCESS && _delivered[task] >= process.regionsBeforeFailure) {
+            return process.walkFailure;
+        }
+        _delivered[task] += 1;
+    }
+    const FakeRegion* region = _regionAtOrAbove(task, address);
+    if (region == nullptr) {
+        return KERN_INVALID_ADDRESS;
+    }
+    address = region->start;
+    size = region->size;
+    info = region->info;
+    count = region->words;
+    return KERN_SUCCESS;
+}
+
+kern_return_t FakeHost::mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
+                                       vm_region_basic_info_64& info, uint32_t&) {
+    _count("mach_vm_region");
+    const FakeRegion* region = _regionAtOrAbove(task, address);
+    if (region == nullptr) {
+        return KERN_INVALID_ADDRESS;
+    }
+    address = region->start;
+    size = region->size;
+    info.protection = region->info.protection;
+    info.max_protection = region->info.max_protection;
+    info.offset = region->info.offset;
+    info.user_wired_count = region->info.user_wired_count;
+    return KERN_SUCCESS;
+}
+
+kern_return_t FakeHost::mach_vm_purgable_control(task_t task, uint64_t address, int32_t, int32_t& state) {
+    const FakeRegion* region = _regionAtOrAbove(task, address);
+    if (region == nullptr || region->purgeQueryFails) {
+        return KERN_INVALID_ARGUMENT;
+    }
+    state = region->purgeState;
+    return KERN_SUCCESS;
+}
+
+kern_return_t FakeHost::mach_vm_page_range_query(task_t task, uint64_t start, uint64_t length,
+                                                 std::span<int32_t> dispositions, uint64_t& count) {
+    _count("mach_vm_page_range_query");
+    const FakeProcess& process = processes.at(pidOfTask(task));
+    if (process.pageQueryFailure != KERN_SUCCESS) {
+        return process.pageQueryFailure;
+    }
+    count = std::min<uint64_t>(length / pageSize, dispositions.size());
+    {
+        const std::lock_guard lock(_mutex);
+        pageQueries.emplace_back(start, count);
+    }
+    for (uint64_t page = 0; page < count; ++page) {
+        const uint64_t address = start + page * pageSize;
+        const FakeRegion* region = _regionAtOrAbove(task, address);
+        dispositions[page] = 0;
+        if (region != nullptr && address + pageSize > region->start) {
+            const uint64_t base = region->start / pageSize * pageSize;
+            const uint64_t index = (address - base) / pageSize;
+            dispositions[page] = index < region->pages.size() ? region->pages[index] : 0;
+        }
+    }
+    return KERN_SUCCESS;
+}
+
+int FakeHost::proc_regionfilename(int32_t pid, uint64_t address, std::span<char> path) {
+    _count("proc_regionfilename");
+    const FakeRegion* region = _regionAtOrAbove(static_cast<task_t>(pid) << kTaskShift, address);
+    if (region == nullptr || processes.at(pid).gone) {
+        return 0;
+    }
+    const size_t length = std::min(region->path.size(), path.size());
+    std::copy_n(region->path.begin(), length, path.begin());
+    return static_cast<int>(length);
+}
+
+int FakeHost::proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) {
+    _count("proc_pidinfo.short");
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || process->gone) {
+        return noSuchProcess();
+    }
+    record = {};
+    record.pbsi_pid = static_cast<uint32_t>(pid);
+    record.pbsi_status = process->status;
+    return sizeof(record);
+}
+
+int FakeHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
+    _count("proc_pidinfo.full");
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || process->gone) {
+        return noSuchProcess();
+    }
+    record = {};
+    record.pbi_flags = process->flags;
+    record.pbi_status = process->status;
+    record.pbi_pid = static_cast<uint32_t>(pid);
+    record.pbi_ppid = static_cast<uint32_t>(process->parent);
+    copyText(record.pbi_comm, process->comm);
+    copyText(record.pbi_name, process->name);
+    return sizeof(record);
+}
+
+int FakeHost::proc_listallpids(std::span<int32_t> pids) {
+    if (processListFails) {
+        return -1;
+    }
+    size_t index = 0;
+    for (const auto& [pid, process] : processes) {
+        if (index < pids.size()) {
+            pids[index++] = pid;
+        }
+    }
+    return static_cast<int>(pids.empty() ? processes.size() : index);
+}
+
+int FakeHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || process->gone) {
+        return noSuchProcess();
+    }
+    record = process->usage;
+    return 0;
+}
+
+int FakeHost::proc_get_dirty(int32_t pid, uint32_t& flags) {
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || process->gone) {
+        return noSuchProcess();
+    }
+    flags = process->dirtyFlags;
+    return 0;
+}
+
+int FakeHost::sysctlArgumentMaximum(uint64_t& bytes) {
+    bytes = 4096;
+    return 0;
+}
+
+int FakeHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) {
+    _count("sysctlArgumentArea");
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || process->executable.empty()) {
+        errno = EINVAL;
+        return -1;
+    }
+    const int32_t argumentCount = 1;
+    std::string bytes(reinterpret_cast<const char*>(&argumentCount), sizeof(argumentCount));
+    bytes += process->executable;
+    bytes += std::string(3, '\0');
+    length = std::min(bytes.size(), area.size());
+    std::copy_n(bytes.begin(), length, area.begin());
+    return 0;
+}
+
+int FakeHost::ledgerTemplate(std::span<ledger_template_info>, size_t&) {
+    errno = ENOTSUP;
+    return -1;
+}
+
+int FakeHost::ledgerEntries(int32_t, std::span<ledger_entry_info>, size_t&) {
+    errno = ENOTSUP;
+    return -1;
+}
+
+int FakeHost::sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) {
+    errno = ENOENT;
+    return -1;
+}
+
+int FakeHost::sysctlSelfRegionMemweight(int32_t& value) {
+    _count("sysctlSelfRegionMemweight");
+    if (selfRegionMemweightError != 0) {
+        errno = selfRegionMemweightError;
+        return -1;
+    }
+    value = selfRegionMemweight;
+    return 0;
+}
+
+int FakeHost::setSysctlSelfRegionMemweight(int32_t value) {
+    if (selfRegionMemweightError != 0) {
+        errno = selfRegionMemweightError;
+        return -1;
+    }
+    selfRegionMemweight = value;
+    return 0;
+}
+
+std::string FakeHost::mach_error_string(kern_return_t code) { return "code " + std::to_string(code); }
+
+void FakeHost::mach_error(std::string_view label, kern_return_t code) {
+    const std::lock_guard lock(_mutex);
+    machErrors.push_back(std::string(label) + ": " + std::to_string(code));
+}
+
+std::optional<std::string> FakeHost::describeRegionTypeForTag(uint32_t tag) {
+    const auto found = tagDescriptions.find(tag);
+    return found == tagDescriptions.end() ? std::nullopt : std::optional(found->second);
+}
+
+void FakeHost::forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) {
+    for (const auto& image : processes.at(pidOfTask(task)).images) {
+        block(FakeImageCursor(image));
+    }
+}
+
+int FakeHost::mach_get_times(MWClockReading& reading) {
+    if (clockFails) {
+        return -1;
+    }
+    reading = clock;
+    return 0;
+}

@@ -1,0 +1,125 @@
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <mutex>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "platform/MWHostInterface.h"
+
+/// A region as a test writes it down; `pages` are the disposition words of its pages, missing ones are 0.
+struct FakeRegion {
+    uint64_t start = 0;
+    uint64_t size = 0;
+    vm_region_submap_info_64 info = {};
+    std::string path = {};
+    std::vector<int32_t> pages = {};
+    int32_t purgeState = VM_PURGABLE_DENY;
+    bool purgeQueryFails = false;
+    uint32_t words = VM_REGION_SUBMAP_INFO_COUNT_64;
+};
+
+struct FakeImage {
+    std::string path;
+    uint64_t baseAddress = 0;
+    std::vector<MWImageSegmentDescription> segments = {};
+};
+
+struct FakeProcess {
+    int32_t parent = 1;
+    std::string comm = {};
+    std::string name = {};
+    std::string executable = {};  ///< path in the argument area; empty: the area cannot be read
+    uint32_t flags = PROC_FLAG_LP64;
+    uint32_t status = 2;
+    bool refused = false;  ///< task_read_for_pid fails
+    std::vector<FakeRegion> regions = {};
+    std::vector<FakeImage> images = {};
+    /// What the walk answers once `regionsBeforeFailure` regions were delivered, when not KERN_SUCCESS.
+    kern_return_t walkFailure = KERN_SUCCESS;
+    size_t regionsBeforeFailure = 0;
+    kern_return_t pageQueryFailure = KERN_SUCCESS;
+    bool gone = false;  ///< proc_pidinfo fails with ESRCH
+    uint32_t dirtyFlags = 0;
+    rusage_info_v5 usage = {};
+};
+
+/// The system on a page: a test fills `processes` and reads back what was asked. Installs itself as the
+/// current host for its lifetime.
+class FakeHost : public MWHostInterface {
+public:
+    FakeHost();
+    ~FakeHost() override;
+    FakeHost(const FakeHost&) = delete;
+    FakeHost& operator=(const FakeHost&) = delete;
+
+    std::map<int32_t, FakeProcess> processes;
+    uint64_t pageSize = 4096;
+    bool sharedCache = false;
+    int32_t selfRegionMemweight = 0;
+    int selfRegionMemweightError = 0;  ///< errno of both accesses, 0 for success
+    bool processListFails = false;
+    MWClockReading clock = {1000, 2000, 978307200, 500000000};
+    bool clockFails = false;
+    mach_timebase_info_t timebase = {1, 1};
+    int32_t ownPid = 99999;
+    uint32_t effectiveUser = 0;
+    std::set<int> terminals;
+    std::set<std::string> files;  ///< existing paths
+    std::map<uint32_t, std::string> tagDescriptions;
+
+    std::vector<std::string> unlinked;
+    std::vector<std::string> machErrors;            ///< "LABEL: CODE" of each mach_error
+    std::vector<std::pair<uint64_t, uint64_t>> pageQueries;  ///< (start, pages) of each page-range query
+    std::set<task_t> openTasks;
+    /// How often the operation of this name was asked.
+    int asked(const std::string& operation) const;
+
+    kern_return_t task_read_for_pid(int32_t pid, task_t& task) override;
+    void task_release(task_t task) override;
+    bool hasSharedCache(task_t task) override;
+    kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
+                                         vm_region_submap_info_64& info, uint32_t& count) override;
+    kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size, vm_region_basic_info_64& info,
+                                 uint32_t& count) override;
+    kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control, int32_t& state) override;
+    kern_return_t mach_vm_page_range_query(task_t task, uint64_t start, uint64_t length,
+                                           std::span<int32_t> dispositions, uint64_t& count) override;
+    int proc_regionfilename(int32_t pid, uint64_t address, std::span<char> path) override;
+    int proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) override;
+    int proc_pidinfo(int32_t pid, proc_bsdinfo& record) override;
+    int proc_listallpids(std::span<int32_t> pids) override;
+    int proc_pid_rusage(int32_t pid, rusage_info_v5& record) override;
+    int proc_get_dirty(int32_t pid, uint32_t& flags) override;
+    int sysctlArgumentMaximum(uint64_t& bytes) override;
+    int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
+    int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
+    int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
+    int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
+    int sysctlSelfRegionMemweight(int32_t& value) override;
+    int setSysctlSelfRegionMemweight(int32_t value) override;
+    uint64_t vm_kernel_page_size() override { return pageSize; }
+    std::string mach_error_string(kern_return_t code) override;
+    void mach_error(std::string_view label, kern_return_t code) override;
+    std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
+    void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
+    int mach_get_times(MWClockReading& reading) override;
+    mach_timebase_info_t mach_timebase_info() override { return timebase; }
+    int32_t getpid() override { return ownPid; }
+    uint32_t geteuid() override { return effectiveUser; }
+    bool isatty(int descriptor) override { return terminals.contains(descriptor); }
+    bool fileExists(const std::string& path) override { return files.contains(path); }
+    void unlinkRegularFile(const std::string& path) override { unlinked.push_back(path); }
+
+private:
+    void _count(const std::string& operation);
+    FakeProcess* _find(int32_t pid);
+    const FakeRegion* _regionAtOrAbove(task_t task, uint64_t address);
+
+    MWHostInterface* _previous;
+    mutable std::mutex _mutex;  ///< guards what is remembered; gathering asks from several threads
+    std::map<std::string, int> _asked;
+    std::map<task_t, size_t> _delivered;
+};
