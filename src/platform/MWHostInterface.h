@@ -46,7 +46,8 @@ public:
     // Tasks.
 
     /// Read access to a process. Everything asked through `task` is about the process that has the pid now,
-    /// even when the pid is given to another one later. Fails with KERN_FAILURE where the caller may not look.
+    /// even when the pid is given to another one later. Fails with KERN_FAILURE where the caller may not
+    /// look.
     virtual kern_return_t task_read_for_pid(int32_t pid, task_t& task) = 0;
     /// Gives the handle back; the process object that acquired it calls this once.
     virtual void task_release(task_t task) = 0;
@@ -57,8 +58,9 @@ public:
 
     /// The first region at or above `address`; sets address, size, `info` and the number of words filled.
     /// KERN_INVALID_ADDRESS past the last region, MACH_SEND_INVALID_DEST when the process is gone.
-    virtual kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
-                                                 vm_region_submap_info_64& info, uint32_t& count) = 0;
+    virtual kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size,
+                                                 uint32_t& depth, vm_region_submap_info_64& info,
+                                                 uint32_t& count) = 0;
     virtual kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                          vm_region_basic_info_64& info, uint32_t& count) = 0;
     /// `control` is VM_PURGABLE_GET_STATE.

@@ -158,7 +158,8 @@ struct ledger_entry_info {
 };
 static_assert(sizeof(ledger_entry_info) == 48);
 
-/// One entry of the reply to "vm.get_owned_vmobjects": an 8-byte entry count, then this record for each object.
+/// One entry of the reply to "vm.get_owned_vmobjects": an 8-byte entry count, then this record for each
+/// object.
 struct OwnedObjectRecord {
     uint64_t object_id;  ///< same space as `object_id_full`
     uint64_t virtual_size;

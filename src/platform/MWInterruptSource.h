@@ -19,7 +19,7 @@ private:
     void _deliver();
 
     std::function<void()> _handler;
-    int _signals = -1;   ///< signalfd
-    int _cancelled = -1; ///< eventfd
+    int _signals = -1;    ///< signalfd
+    int _cancelled = -1;  ///< eventfd
     std::thread _thread;
 };

@@ -11,7 +11,9 @@ namespace {
 // A task handle is the pid shifted, so that code which mixes the two up does not work by chance.
 constexpr uint32_t kTaskShift = 4;
 
-int32_t pidOfTask(task_t task) { return static_cast<int32_t>(task >> kTaskShift); }
+int32_t pidOfTask(task_t task) {
+    return static_cast<int32_t>(task >> kTaskShift);
+}
 
 template <size_t N>
 void copyText(std::array<char, N>& to, const std::string& from) {
@@ -41,9 +43,13 @@ private:
 
 }  // namespace
 
-FakeHost::FakeHost() : _previous(MWHostInterface::setCurrent(this)) { MWPhysMemweightSwitch::set(false); }
+FakeHost::FakeHost() : _previous(MWHostInterface::setCurrent(this)) {
+    MWPhysMemweightSwitch::set(false);
+}
 
-FakeHost::~FakeHost() { MWHostInterface::setCurrent(_previous); }
+FakeHost::~FakeHost() {
+    MWHostInterface::setCurrent(_previous);
+}
 
 int FakeHost::asked(const std::string& operation) const {
     const std::lock_guard lock(_mutex);
@@ -63,7 +69,8 @@ FakeProcess* FakeHost::_find(int32_t pid) {
 
 const FakeRegion* FakeHost::_regionAtOrAbove(task_t task, uint64_t address) {
     for (const auto& region : processes.at(pidOfTask(task)).regions) {
-        if (region.start + region.size > address) {
+        // Also right for a region that claims to go on past the last address.
+        if (region.start >= address || address - region.start < region.size) {
             return &region;
         }
     }
@@ -87,7 +94,9 @@ void FakeHost::task_release(task_t task) {
     openTasks.erase(task);
 }
 
-bool FakeHost::hasSharedCache(task_t) { return sharedCache; }
+bool FakeHost::hasSharedCache(task_t) {
+    return sharedCache;
+}
 
 kern_return_t FakeHost::mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t&,
                                                vm_region_submap_info_64& info, uint32_t& count) {
@@ -114,6 +123,10 @@ kern_return_t FakeHost::mach_vm_region_recurse(task_t task, uint64_t& address, u
 kern_return_t FakeHost::mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                        vm_region_basic_info_64& info, uint32_t&) {
     _count("mach_vm_region");
+    const FakeProcess& process = processes.at(pidOfTask(task));
+    if (address >= process.mappingFailureFrom) {
+        return process.mappingFailure;
+    }
     const FakeRegion* region = _regionAtOrAbove(task, address);
     if (region == nullptr) {
         return KERN_INVALID_ADDRESS;
@@ -286,7 +299,9 @@ int FakeHost::setSysctlSelfRegionMemweight(int32_t value) {
     return 0;
 }
 
-std::string FakeHost::mach_error_string(kern_return_t code) { return "code " + std::to_string(code); }
+std::string FakeHost::mach_error_string(kern_return_t code) {
+    return "code " + std::to_string(code);
+}
 
 void FakeHost::mach_error(std::string_view label, kern_return_t code) {
     const std::lock_guard lock(_mutex);

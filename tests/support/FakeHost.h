@@ -40,6 +40,9 @@ struct FakeProcess {
     /// What the walk answers once `regionsBeforeFailure` regions were delivered, when not KERN_SUCCESS.
     kern_return_t walkFailure = KERN_SUCCESS;
     size_t regionsBeforeFailure = 0;
+    /// What mach_vm_region answers from this address on.
+    uint64_t mappingFailureFrom = UINT64_MAX;
+    kern_return_t mappingFailure = KERN_FAILURE;
     kern_return_t pageQueryFailure = KERN_SUCCESS;
     bool gone = false;  ///< proc_pidinfo fails with ESRCH
     uint32_t dirtyFlags = 0;
@@ -71,7 +74,7 @@ public:
     std::map<uint32_t, std::string> tagDescriptions;
 
     std::vector<std::string> unlinked;
-    std::vector<std::string> machErrors;            ///< "LABEL: CODE" of each mach_error
+    std::vector<std::string> machErrors;                     ///< "LABEL: CODE" of each mach_error
     std::vector<std::pair<uint64_t, uint64_t>> pageQueries;  ///< (start, pages) of each page-range query
     std::set<task_t> openTasks;
     /// How often the operation of this name was asked.
@@ -82,9 +85,10 @@ public:
     bool hasSharedCache(task_t task) override;
     kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
                                          vm_region_submap_info_64& info, uint32_t& count) override;
-    kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size, vm_region_basic_info_64& info,
-                                 uint32_t& count) override;
-    kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control, int32_t& state) override;
+    kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
+                                 vm_region_basic_info_64& info, uint32_t& count) override;
+    kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control,
+                                           int32_t& state) override;
     kern_return_t mach_vm_page_range_query(task_t task, uint64_t start, uint64_t length,
                                            std::span<int32_t> dispositions, uint64_t& count) override;
     int proc_regionfilename(int32_t pid, uint64_t address, std::span<char> path) override;

@@ -1,0 +1,19 @@
+#include "platform/MWHostInterface.h"
+
+#include <utility>
+
+#include "platform/MWInvariant.h"
+
+namespace {
+// Set on the main thread before any other thread exists, read from all of them.
+MWHostInterface* gCurrentHost = nullptr;
+}  // namespace
+
+MWHostInterface& MWHostInterface::current() {
+    MW_INVARIANT(gCurrentHost != nullptr, "no host is installed");
+    return *gCurrentHost;
+}
+
+MWHostInterface* MWHostInterface::setCurrent(MWHostInterface* host) {
+    return std::exchange(gCurrentHost, host);
+}

@@ -1,0 +1,59 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/MWHostRecords.h"
+#include "platform/linux/ObjectIdentity.h"
+#include "platform/linux/RegionNames.h"
+#include "platform/linux/RegionTags.h"
+#include "platform/linux/ShmemDevices.h"
+
+/// Which process an address space belongs to, as far as the identity of its memory depends on it.
+struct AddressSpaceOwner {
+    int32_t pid = 0;
+    uint64_t startTime = 0;  ///< clock ticks since boot: with the pid it names one process of this boot
+    uint64_t ipcNamespace = 0;
+    int directory = -1;  ///< /proc/PID, for the mounts it sees
+};
+
+/// What all the processes of a run share.
+struct AddressSpaceContext {
+    const ObjectIdentity& identity;
+    ShmemDevices& shmemDevices;
+    RegionNames& names;
+    uint64_t pageSize;
+};
+
+/// One region of an address space, as the host reports it.
+struct AddressSpaceRegion {
+    uint64_t start = 0;
+    uint64_t size = 0;
+    vm_region_submap_info_64 info;
+    Backing backing = Backing::anonymous;
+    std::string path = {};          ///< of a mapped file; empty for everything else
+    uint64_t dirtyFileBytes = 0;    ///< page-cache pages of this mapping that are dirty
+    uint64_t lazilyFreedBytes = 0;  ///< given up with MADV_FREE and not yet taken
+
+    uint64_t end() const { return start + size; }
+};
+
+/// One consistent look at a process's mappings, turned into regions: ascending, without overlap, none empty.
+/// Built from one pass over `smaps`; immutable afterwards.
+class AddressSpace {
+public:
+    AddressSpace(std::vector<procfs::Vma> vmas, const AddressSpaceOwner& owner,
+                 const AddressSpaceContext& context);
+
+    const std::vector<AddressSpaceRegion>& regions() const { return _regions; }
+    /// The region that holds `address`, else the first above it, else none. Costs a binary search.
+    const AddressSpaceRegion* regionAtOrAbove(uint64_t address) const;
+
+private:
+    std::vector<AddressSpaceRegion> _regions;
+};
+
+/// Everything that a mapping's path, flags and device tell of its backing.
+Backing backingOf(const procfs::Vma& vma, ShmemDevices& shmemDevices, int processDirectory);

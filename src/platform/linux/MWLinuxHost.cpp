@@ -1,0 +1,263 @@
+#include "platform/linux/MWLinuxHost.h"
+
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <ctime>
+#include <iterator>
+#include <optional>
+#include <utility>
+
+#include "platform/linux/LinuxTask.h"
+
+namespace {
+
+std::string bootId(int procDirectory) {
+    std::string text;
+    procfs::readFile(procDirectory, "sys/kernel/random/boot_id", text);
+    return text;
+}
+
+// With all the processes of a machine as targets each holds a directory open for the length of a run.
+void raiseDescriptorLimit() {
+    rlimit limit = {};
+    if (getrlimit(RLIMIT_NOFILE, &limit) == 0) {
+        limit.rlim_cur = limit.rlim_max;
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
+}
+
+uint64_t readClock(clockid_t clock) {
+    constexpr uint64_t kNanosecondsPerSecond = 1'000'000'000;
+    timespec time = {};
+    clock_gettime(clock, &time);
+    return static_cast<uint64_t>(time.tv_sec) * kNanosecondsPerSecond + static_cast<uint64_t>(time.tv_nsec);
+}
+
+}  // namespace
+
+MWLinuxHost::MWLinuxHost(const std::string& procDirectory)
+    : _proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
+      _pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
+      _identity(bootId(_proc.get())),
+      _frames(procfs::open(_proc.get(), "kpageflags")) {
+    raiseDescriptorLimit();
+}
+
+MWLinuxHost::~MWLinuxHost() = default;
+
+LinuxTask* MWLinuxHost::_task(task_t task) {
+    const std::lock_guard lock(_tasksMutex);
+    const auto found = _tasks.find(task);
+    return found == _tasks.end() ? nullptr : found->second.get();
+}
+
+kern_return_t MWLinuxHost::task_read_for_pid(int32_t pid, task_t& task) {
+    std::unique_ptr<LinuxTask> opened = LinuxTask::open(_proc.get(), pid);
+    if (opened == nullptr) {
+        return KERN_FAILURE;
+    }
+    const std::lock_guard lock(_tasksMutex);
+    do {
+        ++_lastTask;
+    } while (_lastTask == 0 || _tasks.contains(_lastTask));
+    task = _lastTask;
+    _tasks.emplace(task, std::move(opened));
+    _tasksByPid.emplace(pid, task);
+    return KERN_SUCCESS;
+}
+
+void MWLinuxHost::task_release(task_t task) {
+    const std::lock_guard lock(_tasksMutex);
+    const auto found = _tasks.find(task);
+    if (found != _tasks.end()) {
+        _tasksByPid.erase({found->second->pid(), task});
+        _tasks.erase(found);
+    }
+}
+
+bool MWLinuxHost::hasSharedCache(task_t) {
+    return false;
+}
+
+const AddressSpaceRegion* MWLinuxHost::_regionAtOrAbove(task_t task, uint64_t address, kern_return_t& code) {
+    LinuxTask* record = _task(task);
+    if (record == nullptr) {
+        code = KERN_INVALID_ARGUMENT;
+        return nullptr;
+    }
+    code = record->takeSnapshot({_identity, _shmemDevices, _names, _pageSize});
+    if (code != KERN_SUCCESS) {
+        return nullptr;
+    }
+    const AddressSpaceRegion* region = record->addressSpace().regionAtOrAbove(address);
+    if (region == nullptr) {
+        record->dropSnapshot();
+        code = KERN_INVALID_ADDRESS;
+    }
+    return region;
+}
+
+kern_return_t MWLinuxHost::mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t&,
+                                                  vm_region_submap_info_64& info, uint32_t& count) {
+    kern_return_t code = KERN_SUCCESS;
+    if (const AddressSpaceRegion* region = _regionAtOrAbove(task, address, code)) {
+        address = region->start;
+        size = region->size;
+        info = region->info;
+        count = VM_REGION_SUBMAP_INFO_COUNT_64;
+    }
+    return code;
+}
+
+kern_return_t MWLinuxHost::mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
+                                          vm_region_basic_info_64& info, uint32_t& count) {
+    kern_return_t code = KERN_SUCCESS;
+    if (const AddressSpaceRegion* region = _regionAtOrAbove(task, address, code)) {
+        address = region->start;
+        size = region->size;
+        info = {};
+        info.protection = region->info.protection;
+        info.max_protection = region->info.max_protection;
+        info.shared = region->info.share_mode == SM_SHARED ? 1 : 0;
+        info.offset = region->info.offset;
+        info.user_wired_count = region->info.user_wired_count;
+        count = VM_REGION_BASIC_INFO_COUNT_64;
+    }
+    return code;
+}
+
+kern_return_t MWLinuxHost::mach_vm_purgable_control(task_t, uint64_t, int32_t, int32_t& state) {
+    state = VM_PURGABLE_DENY;
+    return KERN_SUCCESS;
+}
+
+kern_return_t MWLinuxHost::mach_vm_page_range_query(task_t task, uint64_t start, uint64_t length,
+                                                    std::span<int32_t> dispositions, uint64_t& count) {
+    LinuxTask* record = _task(task);
+    if (record == nullptr) {
+        return KERN_INVALID_ARGUMENT;
+    }
+    const kern_return_t code = record->takeSnapshot({_identity, _shmemDevices, _names, _pageSize});
+    if (code != KERN_SUCCESS) {
+        return code;
+    }
+    count = std::min<uint64_t>(length / _pageSize, dispositions.size());
+    return record->fillDispositions(start, dispositions.first(count), _frames, _pageSize);
+}
+
+// Two records of one pid live at once only while sampling replaces one by the other; the newer one is being
+// walked then.
+LinuxTask* MWLinuxHost::_taskOfPid(int32_t pid) {
+    const std::lock_guard lock(_tasksMutex);
+    const auto above = _tasksByPid.upper_bound({pid, UINT32_MAX});
+    if (above == _tasksByPid.begin() || std::prev(above)->first != pid) {
+        return nullptr;
+    }
+    return _tasks.at(std::prev(above)->second).get();
+}
+
+int MWLinuxHost::proc_regionfilename(int32_t pid, uint64_t address, std::span<char> path) {
+    LinuxTask* record = _taskOfPid(pid);
+    if (record == nullptr || !record->hasSnapshot()) {
+        return 0;
+    }
+    const AddressSpaceRegion* region = record->addressSpace().regionAtOrAbove(address);
+    if (region == nullptr || region->start > address) {
+        return 0;
+    }
+    const size_t length = std::min(path.size(), region->path.size());
+    std::copy_n(region->path.begin(), length, path.begin());
+    return static_cast<int>(length);
+}
+
+std::optional<std::string> MWLinuxHost::describeRegionTypeForTag(uint32_t tag) {
+    return _names.nameForTag(tag);
+}
+
+// Images are not listed: file mappings go by their paths.
+void MWLinuxHost::forEachImage(task_t, const std::function<void(const MWImageDescription&)>&) {}
+
+// The control belongs to a kernel that keeps lists of owned objects; this one does not.
+int MWLinuxHost::sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) {
+    errno = ENOENT;
+    return -1;
+}
+
+int MWLinuxHost::sysctlSelfRegionMemweight(int32_t& value) {
+    value = _selfRegionMemweight;
+    return 0;
+}
+
+int MWLinuxHost::setSysctlSelfRegionMemweight(int32_t value) {
+    _selfRegionMemweight = value;
+    return 0;
+}
+
+std::string MWLinuxHost::mach_error_string(kern_return_t code) {
+    switch (code) {
+        case KERN_SUCCESS:
+            return "(os/kern) successful";
+        case KERN_INVALID_ADDRESS:
+            return "(os/kern) invalid address";
+        case KERN_INVALID_ARGUMENT:
+            return "(os/kern) invalid argument";
+        case KERN_FAILURE:
+            return "(os/kern) failure";
+        case MACH_SEND_INVALID_DEST:
+            return "the address space is gone";
+        default:
+            return "error " + std::to_string(code);
+    }
+}
+
+void MWLinuxHost::mach_error(std::string_view label, kern_return_t code) {
+    std::fprintf(stderr, "%.*s: %s\n", static_cast<int>(label.size()), label.data(),
+                 mach_error_string(code).c_str());
+}
+
+int MWLinuxHost::mach_get_times(MWClockReading& reading) {
+    timespec wall = {};
+    if (clock_gettime(CLOCK_REALTIME, &wall) != 0) {
+        return -1;
+    }
+    reading = {.absoluteTicks = readClock(CLOCK_MONOTONIC),
+               .continuousTicks = readClock(CLOCK_BOOTTIME),
+               .wallSeconds = wall.tv_sec,
+               .wallNanoseconds = wall.tv_nsec};
+    return 0;
+}
+
+mach_timebase_info_t MWLinuxHost::mach_timebase_info() {
+    return {.numer = 1, .denom = 1};
+}
+
+int32_t MWLinuxHost::getpid() {
+    return ::getpid();
+}
+
+uint32_t MWLinuxHost::geteuid() {
+    return ::geteuid();
+}
+
+bool MWLinuxHost::isatty(int descriptor) {
+    return ::isatty(descriptor) != 0;
+}
+
+bool MWLinuxHost::fileExists(const std::string& path) {
+    struct stat status = {};
+    return ::stat(path.c_str(), &status) == 0;
+}
+
+void MWLinuxHost::unlinkRegularFile(const std::string& path) {
+    struct stat status = {};
+    if (::lstat(path.c_str(), &status) == 0 && S_ISREG(status.st_mode)) {
+        ::unlink(path.c_str());
+    }
+}

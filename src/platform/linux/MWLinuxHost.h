@@ -1,0 +1,110 @@
+#pragma once
+
+#include <atomic>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/MWHostInterface.h"
+#include "platform/linux/AddressSpace.h"
+#include "platform/linux/LinuxTask.h"
+#include "platform/linux/ObjectIdentity.h"
+#include "platform/linux/PageDispositions.h"
+#include "platform/linux/ProcText.h"
+#include "platform/linux/Procfs.h"
+#include "platform/linux/RegionNames.h"
+#include "platform/linux/ShmemDevices.h"
+
+/// The live answer: Linux processes, measured through procfs (5.10 and newer).
+///
+/// A task holds its process's directory open, so that everything asked through it is about that process even
+/// when its pid is given away. One walk sees one snapshot of the address space: the first question about
+/// regions takes it, the answer that the end was reached drops it.
+class MWLinuxHost : public MWHostInterface {
+public:
+    /// `procDirectory` is the root of a procfs, or of a tree of recorded files.
+    explicit MWLinuxHost(const std::string& procDirectory = "/proc");
+    ~MWLinuxHost() override;
+    MWLinuxHost(const MWLinuxHost&) = delete;
+    MWLinuxHost& operator=(const MWLinuxHost&) = delete;
+
+    kern_return_t task_read_for_pid(int32_t pid, task_t& task) override;
+    void task_release(task_t task) override;
+    /// Linux has none.
+    bool hasSharedCache(task_t task) override;
+
+    kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
+                                         vm_region_submap_info_64& info, uint32_t& count) override;
+    kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
+                                 vm_region_basic_info_64& info, uint32_t& count) override;
+    /// Nothing on Linux is purgeable: always VM_PURGABLE_DENY.
+    kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control,
+                                           int32_t& state) override;
+    kern_return_t mach_vm_page_range_query(task_t task, uint64_t start, uint64_t length,
+                                           std::span<int32_t> dispositions, uint64_t& count) override;
+    int proc_regionfilename(int32_t pid, uint64_t address, std::span<char> path) override;
+
+    int proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) override;
+    int proc_pidinfo(int32_t pid, proc_bsdinfo& record) override;
+    /// Without kernel threads: they are the kernel, which is pid 0.
+    int proc_listallpids(std::span<int32_t> pids) override;
+    /// Charge: RssAnon + RssShmem + VmSwap + VmPTE + HugetlbPages of `status`. Peak: the larger of that and
+    /// VmHWM, which includes clean file pages.
+    int proc_pid_rusage(int32_t pid, rusage_info_v5& record) override;
+    /// Linux tracks none: the flags are 0.
+    int proc_get_dirty(int32_t pid, uint32_t& flags) override;
+    int sysctlArgumentMaximum(uint64_t& bytes) override;
+    int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
+
+    /// One entry, "page_table"; its balance is VmPTE.
+    int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
+    int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
+
+    int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
+    int sysctlSelfRegionMemweight(int32_t& value) override;
+    int setSysctlSelfRegionMemweight(int32_t value) override;
+    uint64_t vm_kernel_page_size() override { return _pageSize; }
+    std::string mach_error_string(kern_return_t code) override;
+    void mach_error(std::string_view label, kern_return_t code) override;
+
+    std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
+    void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
+
+    int mach_get_times(MWClockReading& reading) override;
+    mach_timebase_info_t mach_timebase_info() override;
+
+    int32_t getpid() override;
+    uint32_t geteuid() override;
+    bool isatty(int descriptor) override;
+    bool fileExists(const std::string& path) override;
+    void unlinkRegularFile(const std::string& path) override;
+
+private:
+    LinuxTask* _task(task_t task);
+    LinuxTask* _taskOfPid(int32_t pid);
+    /// From the task's snapshot, which is taken when there is none; `code` says why there is no region.
+    const AddressSpaceRegion* _regionAtOrAbove(task_t task, uint64_t address, kern_return_t& code);
+    /// The process's directory: the one that a task of this pid holds open, else opened anew into `opened`.
+    int _processDirectory(int32_t pid, procfs::Descriptor& opened);
+    /// A small file of a process; false with errno on failure, ESRCH when the process is gone.
+    bool _readProcessFile(int32_t pid, const char* name, std::string& text);
+    std::optional<procfs::ProcStat> _statOfPid(int32_t pid);
+
+    procfs::Descriptor _proc;
+    uint64_t _pageSize;
+    ObjectIdentity _identity;
+    ShmemDevices _shmemDevices;
+    RegionNames _names;
+    PageFrameFlags _frames;
+    std::atomic<int32_t> _selfRegionMemweight = 0;
+
+    std::mutex _tasksMutex;  ///< guards the table; a task itself is one thread's at a time
+    std::map<task_t, std::unique_ptr<LinuxTask>> _tasks;
+    std::set<std::pair<int32_t, task_t>> _tasksByPid;
+    task_t _lastTask = 0;
+};

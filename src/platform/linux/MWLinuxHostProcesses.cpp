@@ -1,0 +1,224 @@
+#include <dirent.h>
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <elf.h>
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+
+#include "platform/linux/MWLinuxHost.h"
+
+// The questions about processes as such: the list, their records, names and the kernel's own figures.
+
+namespace {
+
+constexpr uint32_t kRunning = 2;
+
+template <size_t N>
+void copyText(std::array<char, N>& to, std::string_view from) {
+    std::copy_n(from.begin(), std::min(from.size(), N), to.begin());
+}
+
+// A directory entry that has gone, and a text that cannot be read any more, both mean that the process has.
+int noSuchProcess() {
+    errno = ESRCH;
+    return -1;
+}
+
+// The kernel itself, as pid 0.
+proc_bsdinfo kernelRecord() {
+    proc_bsdinfo record = {};
+    record.pbi_flags = PROC_FLAG_SYSTEM | PROC_FLAG_LP64;
+    record.pbi_status = kRunning;
+    copyText(record.pbi_comm, "kernel");
+    copyText(record.pbi_name, "kernel");
+    return record;
+}
+
+// The class byte of the executable.
+bool executableIs64bit(int directory) {
+    std::string header;
+    procfs::readFile(directory, "exe", header, EI_NIDENT);
+    return header.size() <= EI_CLASS || header[EI_CLASS] != ELFCLASS32;
+}
+
+uint64_t physicalCharge(const procfs::ProcStatus& status) {
+    return status.rssAnon + status.rssShmem + status.vmSwap + status.vmPte + status.hugetlbPages;
+}
+
+std::vector<int32_t> numericEntries(int procDirectory) {
+    std::vector<int32_t> pids;
+    procfs::Descriptor list = procfs::open(procDirectory, ".", O_DIRECTORY);
+    DIR* entries = list ? fdopendir(list.get()) : nullptr;
+    if (entries == nullptr) {
+        return pids;
+    }
+    list.release();  // closed with the stream
+    while (const dirent* entry = readdir(entries)) {
+        std::string_view name = entry->d_name;
+        int32_t pid = 0;
+        if (procfs::takeNumber(name, pid) && name.empty()) {
+            pids.push_back(pid);
+        }
+    }
+    closedir(entries);
+    std::sort(pids.begin(), pids.end());
+    return pids;
+}
+
+}  // namespace
+
+int MWLinuxHost::_processDirectory(int32_t pid, procfs::Descriptor& opened) {
+    if (const LinuxTask* task = _taskOfPid(pid)) {
+        return task->directory();
+    }
+    opened = procfs::open(_proc.get(), std::to_string(pid).c_str(), O_PATH | O_DIRECTORY);
+    return opened.get();
+}
+
+bool MWLinuxHost::_readProcessFile(int32_t pid, const char* name, std::string& text) {
+    procfs::Descriptor opened;
+    const int directory = _processDirectory(pid, opened);
+    const bool read = directory >= 0 && procfs::readFile(directory, name, text);
+    if (!read && (errno == ENOENT || errno == EBADF)) {
+        errno = ESRCH;
+    }
+    return read;
+}
+
+std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
+    std::string text;
+    return _readProcessFile(pid, "stat", text) ? procfs::parseStat(text) : std::nullopt;
+}
+
+int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
+    const std::vector<int32_t> entries = numericEntries(_proc.get());
+    if (entries.empty()) {
+        return -1;
+    }
+    if (pids.empty()) {
+        return static_cast<int>(entries.size() + 1);
+    }
+    size_t filled = 0;
+    pids[filled++] = 0;
+    for (const int32_t pid : entries) {
+        const auto stat = _statOfPid(pid);
+        if (stat && !stat->isKernelThread() && filled < pids.size()) {
+            pids[filled++] = pid;
+        }
+    }
+    return static_cast<int>(filled);
+}
+
+int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) {
+    const auto stat = _statOfPid(pid);
+    if (!stat) {
+        return noSuchProcess();
+    }
+    record = {};
+    record.pbsi_pid = static_cast<uint32_t>(pid);
+    record.pbsi_ppid = static_cast<uint32_t>(stat->ppid);
+    record.pbsi_status = stat->isZombie() ? SZOMB : kRunning;
+    copyText(record.pbsi_comm, stat->comm);
+    return sizeof(record);
+}
+
+int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
+    if (pid == 0) {
+        record = kernelRecord();
+        return sizeof(record);
+    }
+    procfs::Descriptor opened;
+    const int directory = _processDirectory(pid, opened);
+    std::string text;
+    const auto stat =
+        directory >= 0 && procfs::readFile(directory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
+    if (!stat || stat->isKernelThread()) {
+        return noSuchProcess();
+    }
+    record = {};
+    record.pbi_pid = static_cast<uint32_t>(pid);
+    record.pbi_ppid = static_cast<uint32_t>(stat->ppid);
+    record.pbi_status = stat->isZombie() ? SZOMB : kRunning;
+    copyText(record.pbi_comm, stat->comm);
+    procfs::readFile(directory, "cmdline", text);
+    copyText(record.pbi_name, procfs::nameFromCommandLine(text));
+    procfs::readFile(directory, "auxv", text);
+    const std::optional<bool> is64bit = procfs::auxvIs64bit(text);
+    record.pbi_flags = (is64bit ? *is64bit : executableIs64bit(directory)) ? PROC_FLAG_LP64 : 0;
+    return sizeof(record);
+}
+
+int MWLinuxHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
+    std::string text;
+    if (!_readProcessFile(pid, "status", text)) {
+        return -1;
+    }
+    const procfs::ProcStatus status = procfs::parseStatus(text);
+    record.ri_phys_memweight = physicalCharge(status);
+    record.ri_lifetime_max_phys_memweight = std::max(record.ri_phys_memweight, status.vmHwm);
+    return 0;
+}
+
+int MWLinuxHost::proc_get_dirty(int32_t pid, uint32_t& flags) {
+    flags = 0;
+    return _statOfPid(pid) ? 0 : noSuchProcess();
+}
+
+int MWLinuxHost::sysctlArgumentMaximum(uint64_t& bytes) {
+    const long maximum = sysconf(_SC_ARG_MAX);
+    bytes = static_cast<uint64_t>(std::max(maximum, 0L));
+    return maximum > 0 ? 0 : -1;
+}
+
+// The argument count, the executable's path, then the arguments. An executable that was replaced while it ran
+// keeps its name without the mark that the kernel adds.
+int MWLinuxHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) {
+    procfs::Descriptor opened;
+    const int directory = _processDirectory(pid, opened);
+    std::string path;
+    std::string arguments;
+    if (directory < 0 || !procfs::readLink(directory, "exe", path)) {
+        return -1;
+    }
+    constexpr std::string_view kDeleted = " (deleted)";
+    if (path.ends_with(kDeleted)) {
+        path.resize(path.size() - kDeleted.size());
+    }
+    procfs::readFile(directory, "cmdline", arguments);
+    const auto count = static_cast<int32_t>(std::count(arguments.begin(), arguments.end(), '\0'));
+    std::string bytes(sizeof(count), '\0');
+    std::memcpy(bytes.data(), &count, sizeof(count));
+    bytes.append(path).append(1, '\0').append(arguments);
+    length = std::min(area.size(), bytes.size());
+    std::copy_n(bytes.begin(), length, area.begin());
+    return 0;
+}
+
+int MWLinuxHost::ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) {
+    filled = 0;
+    if (!records.empty()) {
+        records.front() = {};
+        copyText(records.front().lti_name, "page_table");
+        copyText(records.front().lti_group, "physmem");
+        copyText(records.front().lti_units, "bytes");
+        filled = 1;
+    }
+    return 0;
+}
+
+int MWLinuxHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) {
+    std::string text;
+    filled = 0;
+    if (!_readProcessFile(pid, "status", text)) {
+        return -1;
+    }
+    if (!records.empty()) {
+        records.front() = {};
+        records.front().lei_balance = static_cast<int64_t>(procfs::parseStatus(text).vmPte);
+        filled = 1;
+    }
+    return 0;
+}

@@ -1,0 +1,44 @@
+#include "platform/linux/ObjectIdentity.h"
+
+#include <sodium/crypto_shorthash.h>
+
+#include <cstring>
+
+static_assert(crypto_shorthash_KEYBYTES == 16 && crypto_shorthash_BYTES == 8);
+
+namespace {
+enum Kind : uint64_t { kFile = 1, kSysV = 2, kProcess = 3 };
+}  // namespace
+
+// "xxxxxxxx-xxxx-...": the hexadecimal digits are the key.
+ObjectIdentity::ObjectIdentity(std::string_view bootId) {
+    size_t digits = 0;
+    for (const char character : bootId) {
+        const size_t digit = std::string_view("0123456789abcdef").find(character);
+        if (digit != std::string_view::npos && digits < 2 * _key.size()) {
+            _key[digits / 2] = static_cast<unsigned char>((_key[digits / 2] << 4U) | digit);
+            ++digits;
+        }
+    }
+}
+
+uint64_t ObjectIdentity::file(uint64_t device, uint64_t inode) const {
+    return _hash({kFile, device, inode, 0});
+}
+
+uint64_t ObjectIdentity::sysV(uint64_t device, uint64_t inode, uint64_t ipcNamespace) const {
+    return _hash({kSysV, device, inode, ipcNamespace});
+}
+
+uint64_t ObjectIdentity::process(int32_t pid, uint64_t startTime, uint64_t address) const {
+    return _hash({kProcess, static_cast<uint64_t>(pid), startTime, address});
+}
+
+uint64_t ObjectIdentity::_hash(const std::array<uint64_t, 4>& what) const {
+    std::array<unsigned char, sizeof(what)> bytes = {};
+    std::memcpy(bytes.data(), what.data(), bytes.size());
+    uint64_t hash = 0;
+    crypto_shorthash(reinterpret_cast<unsigned char*>(&hash), bytes.data(), bytes.size(), _key.data());
+    hash |= uint64_t{1} << 63U;
+    return hash == UINT64_MAX ? hash - 1 : hash;
+}

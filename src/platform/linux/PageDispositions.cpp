@@ -1,0 +1,70 @@
+#include "platform/linux/PageDispositions.h"
+
+#include <unistd.h>
+
+#include <algorithm>
+
+namespace {
+
+// Takes one page off a count of bytes, if there is one left.
+bool takePage(uint64_t& bytesLeft, uint64_t pageSize) {
+    const uint64_t taken = std::min(bytesLeft, pageSize);
+    bytesLeft -= taken;
+    return taken != 0;
+}
+
+}  // namespace
+
+uint64_t PageFrameFlags::flagsOfFrame(uint64_t frame) const {
+    uint64_t flags = 0;
+    const auto offset = static_cast<off_t>(frame * sizeof(flags));
+    return ::pread(_file.get(), &flags, sizeof(flags), offset) == sizeof(flags) ? flags : 0;
+}
+
+void PageDispositions::fill(const AddressSpaceRegion& region, uint64_t address,
+                            std::span<const PagemapEntry> entries, const PageFrameFlags& frames,
+                            uint64_t pageSize, std::span<int32_t> words) {
+    if (address != _next || address == region.start) {
+        _dirtyFileBytesLeft = region.dirtyFileBytes;
+        _lazilyFreedBytesLeft = region.lazilyFreedBytes;
+    }
+    for (size_t page = 0; page < entries.size(); ++page) {
+        words[page] = _word(region, entries[page], frames, pageSize);
+    }
+    _next = address + entries.size() * pageSize;
+}
+
+int32_t PageDispositions::_word(const AddressSpaceRegion& region, PagemapEntry entry,
+                                const PageFrameFlags& frames, uint64_t pageSize) {
+    if (entry.swapped()) {
+        return VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    }
+    if (!entry.present()) {
+        return 0;
+    }
+    const bool isFilePage = region.backing == Backing::file && entry.fileOrShared();
+    const bool flagsNeeded = isFilePage ? region.dirtyFileBytes != 0 : region.lazilyFreedBytes != 0;
+    const bool flagsKnown = flagsNeeded && frames.readable() && entry.frame() != 0;
+    const uint64_t flags = flagsKnown ? frames.flagsOfFrame(entry.frame()) : 0;
+    if (isFilePage) {
+        const bool dirty = _isDirtyFilePage(flags, flagsKnown, pageSize);
+        return VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL |
+               (dirty ? VM_PAGE_QUERY_PAGE_DIRTY : 0);
+    }
+    if (region.backing == Backing::special) {
+        return VM_PAGE_QUERY_PAGE_PRESENT;
+    }
+    const bool reusable = _isLazilyFreed(flags, flagsKnown, pageSize);
+    return VM_PAGE_QUERY_PAGE_PRESENT | (reusable ? VM_PAGE_QUERY_PAGE_REUSABLE : VM_PAGE_QUERY_PAGE_DIRTY);
+}
+
+bool PageDispositions::_isDirtyFilePage(uint64_t flags, bool flagsKnown, uint64_t pageSize) {
+    return flagsKnown ? (flags & PageFrameFlags::kDirty) != 0 : takePage(_dirtyFileBytesLeft, pageSize);
+}
+
+bool PageDispositions::_isLazilyFreed(uint64_t flags, bool flagsKnown, uint64_t pageSize) {
+    if (!flagsKnown) {
+        return takePage(_lazilyFreedBytesLeft, pageSize);
+    }
+    return (flags & PageFrameFlags::kAnonymous) != 0 && (flags & PageFrameFlags::kSwapBacked) == 0;
+}

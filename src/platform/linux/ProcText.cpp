@@ -1,0 +1,110 @@
+#include "platform/linux/ProcText.h"
+
+#include <array>
+#include <cstring>
+#include <utility>
+
+namespace procfs {
+
+namespace {
+
+// Takes one blank-separated word and the blank behind it.
+std::string_view takeWord(std::string_view& text) {
+    const size_t end = text.find(' ');
+    const std::string_view word = text.substr(0, end);
+    text.remove_prefix(end == std::string_view::npos ? text.size() : end + 1);
+    return word;
+}
+
+template <class Number>
+bool takeField(std::string_view& text, Number& number) {
+    std::string_view word = takeWord(text);
+    return takeNumber(word, number);
+}
+
+}  // namespace
+
+std::optional<uint64_t> parseKilobytes(std::string_view text) {
+    skipBlanks(text);
+    uint64_t kilobytes = 0;
+    if (!takeNumber(text, kilobytes) || kilobytes > UINT64_MAX / 1024) {
+        return std::nullopt;
+    }
+    skipBlanks(text);
+    return text.starts_with("kB") ? std::optional(kilobytes * 1024) : std::nullopt;
+}
+
+// The command name stands in parentheses and can hold blanks and parentheses itself, so the fields behind it
+// are counted from the last closing one.
+std::optional<ProcStat> parseStat(std::string_view text) {
+    ProcStat stat;
+    const size_t close = text.rfind(')');
+    std::string_view front = text;
+    if (close == std::string_view::npos || !takeNumber(front, stat.pid) || !takePrefix(front, " (")) {
+        return std::nullopt;
+    }
+    const size_t nameStart = static_cast<size_t>(front.data() - text.data());
+    if (close < nameStart || close + 2 >= text.size()) {
+        return std::nullopt;
+    }
+    stat.comm = text.substr(nameStart, close - nameStart);
+    std::string_view rest = text.substr(close + 2);
+    stat.state = takeWord(rest).front();
+    if (!takeField(rest, stat.ppid)) {
+        return std::nullopt;
+    }
+    // The words passed over before flags (9), num_threads (20), starttime (22) and startstack (28).
+    constexpr std::array<int, 4> kSkippedBefore = {4, 10, 1, 5};
+    const std::array<uint64_t*, 4> fields = {&stat.flags, &stat.threads, &stat.startTime, &stat.startStack};
+    for (size_t i = 0; i < fields.size(); ++i) {
+        for (int skipped = 0; skipped < kSkippedBefore[i]; ++skipped) {
+            takeWord(rest);
+        }
+        if (!takeField(rest, *fields[i])) {
+            return std::nullopt;
+        }
+    }
+    return stat;
+}
+
+ProcStatus parseStatus(std::string_view text) {
+    ProcStatus status;
+    const std::array<std::pair<std::string_view, uint64_t*>, 6> fields = {
+        {{"VmHWM:", &status.vmHwm},
+         {"RssAnon:", &status.rssAnon},
+         {"RssShmem:", &status.rssShmem},
+         {"VmPTE:", &status.vmPte},
+         {"VmSwap:", &status.vmSwap},
+         {"HugetlbPages:", &status.hugetlbPages}}};
+    while (!text.empty()) {
+        std::string_view line = takeLine(text);
+        for (const auto& [name, value] : fields) {
+            if (takePrefix(line, name)) {
+                *value = parseKilobytes(line).value_or(0);
+                break;
+            }
+        }
+    }
+    return status;
+}
+
+std::string nameFromCommandLine(std::string_view commandLine) {
+    const std::string_view program = commandLine.substr(0, commandLine.find('\0'));
+    if (program.find_first_of(" :") != std::string_view::npos) {
+        return {};
+    }
+    return std::string(program.substr(program.rfind('/') + 1));
+}
+
+// Entries are pairs of type and value; the first type is a small number, so in the 32-bit form the upper half
+// of the first eight bytes is the first value, which is an address or a capability mask and not 0.
+std::optional<bool> auxvIs64bit(std::string_view auxv) {
+    uint64_t first = 0;
+    if (auxv.size() < sizeof(first)) {
+        return std::nullopt;
+    }
+    std::memcpy(&first, auxv.data(), sizeof(first));
+    return first <= UINT32_MAX;
+}
+
+}  // namespace procfs

@@ -1,0 +1,72 @@
+#include "platform/linux/Procfs.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <utility>
+
+namespace procfs {
+
+Descriptor& Descriptor::operator=(Descriptor&& other) noexcept {
+    if (this != &other) {
+        reset();
+        _descriptor = other.release();
+    }
+    return *this;
+}
+
+int Descriptor::release() {
+    return std::exchange(_descriptor, -1);
+}
+
+void Descriptor::reset() {
+    if (_descriptor >= 0) {
+        ::close(release());
+    }
+}
+
+Descriptor open(int directory, const char* path, int flags) {
+    return Descriptor(::openat(directory, path, O_RDONLY | O_CLOEXEC | flags));
+}
+
+ptrdiff_t readSome(int descriptor, std::span<char> buffer) {
+    ptrdiff_t count = 0;
+    do {
+        count = ::read(descriptor, buffer.data(), buffer.size());
+    } while (count < 0 && errno == EINTR);
+    return count;
+}
+
+bool readFile(int directory, const char* path, std::string& text, size_t limit) {
+    constexpr size_t kStep = 4096;
+    text.clear();
+    const Descriptor file = open(directory, path);
+    if (!file) {
+        return false;
+    }
+    while (text.size() < limit) {
+        const size_t length = text.size();
+        text.resize(std::min(limit, length + kStep));
+        const ptrdiff_t count = readSome(file.get(), std::span(text).subspan(length));
+        text.resize(length + static_cast<size_t>(std::max<ptrdiff_t>(count, 0)));
+        if (count <= 0) {
+            return count == 0;
+        }
+    }
+    return true;
+}
+
+bool readLink(int directory, const char* path, std::string& target) {
+    std::array<char, 4096> buffer = {};
+    const ptrdiff_t length = ::readlinkat(directory, path, buffer.data(), buffer.size());
+    if (length < 0) {
+        return false;
+    }
+    target.assign(buffer.data(), static_cast<size_t>(length));
+    return true;
+}
+
+}  // namespace procfs

@@ -1,0 +1,177 @@
+#include "platform/linux/AddressSpace.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+#include "platform/MWRegionTags.h"
+
+namespace {
+
+constexpr uint64_t kPage = 4096;
+
+/// Builds regions from the text of smaps, for a process on whose mounts nothing is tmpfs.
+class AddressSpaceTest : public testing::Test {
+protected:
+    AddressSpace build(const std::string& smaps, int32_t pid = 10, uint64_t ipcNamespace = 1) {
+        return {procfs::parseSmaps(smaps),
+                {.pid = pid, .startTime = 5, .ipcNamespace = ipcNamespace, .directory = -1},
+                {_identity, _devices, _names, kPage}};
+    }
+
+    AddressSpaceRegion only(const std::string& smaps, int32_t pid = 10, uint64_t ipcNamespace = 1) {
+        const AddressSpace space = build(smaps, pid, ipcNamespace);
+        EXPECT_EQ(space.regions().size(), 1U);
+        return space.regions().front();
+    }
+
+    ObjectIdentity _identity{"0dd6b3ac-0f4b-4c3c-8b0f-5f5f1f0a6d11"};
+    ShmemDevices _devices;
+    RegionNames _names;
+};
+
+// KIND: what the mapping line says; TAG, SHARE MODE, PAGER: what the region says; DIRTY PAGES of 10 resident
+// pages of which 3 are dirty, 4 anonymous and 1 is lazily freed.
+struct KindRow {
+    const char* line;
+    uint32_t tag;
+    uint8_t shareMode;
+    uint8_t pager;
+    uint32_t dirtyPages;
+};
+
+TEST_F(AddressSpaceTest, EachKindOfMapping) {
+    const std::string counts =
+        "\nRss: 40 kB\nPrivate_Dirty: 12 kB\nAnonymous: 16 kB\nLazyFree: 4 kB\nSwap: 8 kB\nVmFlags: rd\n";
+    for (const KindRow& row : {
+             KindRow{"rw-p 00000000 00:00 0", MWTagNone, SM_PRIVATE, 0, 3},
+             KindRow{"rw-p 00000000 00:00 0 [heap]", MWTagBrkHeap, SM_PRIVATE, 0, 3},
+             KindRow{"rw-p 00000000 00:00 0 [stack]", MWTagMainStack, SM_PRIVATE, 0, 3},
+             KindRow{"rwxp 00000000 00:00 0", MWTagJitCode, SM_PRIVATE, 0, 3},
+             KindRow{"rw-p 00000000 00:06 4 /dev/zero", MWTagNone, SM_PRIVATE, 0, 3},
+             KindRow{"r-xp 00000000 00:00 0 [vdso]", MWTagVdso, SM_PRIVATE, 0, 3},
+             KindRow{"rw-p 00001000 fe:00 9 /usr/lib/libx.so", MWTagNone, SM_COW, 1, 3},
+             KindRow{"rw-s 00001000 fe:00 9 /srv/data", MWTagNone, SM_SHARED, 1, 3},
+             KindRow{"rw-s 00000000 00:01 9 /dev/zero (deleted)", MWTagSharedAnonymous, SM_SHARED, 0, 10},
+             KindRow{"rw-s 00000000 00:01 9 /memfd:buffer (deleted)", MWTagMemfd, SM_SHARED, 0, 10},
+             KindRow{"rw-s 00000000 00:01 0 /SYSV00000000 (deleted)", MWTagSysV, SM_SHARED, 0, 10},
+             KindRow{"rw-s 00000000 00:06 9 /dev/dri/card0", MWTagDrm, SM_SHARED, 0, 3},
+             KindRow{"rw-s 00000000 00:0e 9 anon_inode:[io_uring]", MWTagIoUring, SM_SHARED, 0, 3},
+             KindRow{"rw-s 00000000 00:0e 9 anon_inode:[else]", MWTagAnonInode, SM_SHARED, 0, 3},
+         }) {
+        // A zero device of the kernel's own mount is only known as such on the machine that runs the test.
+        const bool internalMount = std::string(row.line).find("/dev/zero (deleted)") != std::string::npos;
+        const AddressSpaceRegion region = only("100000-200000 " + std::string(row.line) + counts);
+        if (internalMount && region.backing != Backing::shmem) {
+            continue;
+        }
+        EXPECT_EQ(region.info.user_tag, row.tag) << row.line;
+        EXPECT_EQ(region.info.share_mode, row.shareMode) << row.line;
+        EXPECT_EQ(region.info.external_pager, row.pager) << row.line;
+        EXPECT_EQ(region.info.pages_dirtied, row.dirtyPages) << row.line;
+        EXPECT_EQ(region.info.pages_resident, 10U) << row.line;
+        EXPECT_EQ(region.info.pages_reusable, 1U) << row.line;
+        EXPECT_EQ(region.info.pages_swapped_out, 2U) << row.line;
+        EXPECT_EQ(region.path.empty(), row.pager == 0) << "only files have a path to report: " << row.line;
+    }
+}
+
+TEST_F(AddressSpaceTest, HugePagesAreResidentWiredAndDirty) {
+    const AddressSpaceRegion region = only(
+        "100000-600000 rw-p 00000000 00:0f 12 /anon_hugepage (deleted)\n"
+        "Rss: 0 kB\nShared_Hugetlb: 2048 kB\nPrivate_Hugetlb: 4096 kB\nVmFlags: rd wr ht \n");
+    EXPECT_EQ(region.info.pages_resident, 1536U);
+    EXPECT_EQ(region.info.pages_dirtied, 1536U);
+    EXPECT_EQ(region.info.user_wired_count, 1U);
+    EXPECT_EQ(region.info.user_tag, MWTagHugetlb);
+}
+
+TEST_F(AddressSpaceTest, AnonymousMemoryThatWasNeverTouchedBelongsToNoObject) {
+    const AddressSpaceRegion region = only("100000-200000 rw-p 00000000 00:00 0\nRss: 0 kB\nSwap: 0 kB\n");
+    EXPECT_EQ(region.info.object_id_full, 0U);
+    EXPECT_EQ(region.info.share_mode, SM_EMPTY);
+}
+
+TEST_F(AddressSpaceTest, MappingsOfOneObjectAreOneAcrossProcesses) {
+    const auto identity = [&](const std::string& line, int32_t pid, uint64_t ipcNamespace = 1) {
+        return only("100000-200000 " + line + "\nRss: 4 kB\n", pid, ipcNamespace).info.object_id_full;
+    };
+    const std::string file = "r--p 00001000 fe:00 9 /usr/lib/libx.so";
+    const std::string segment = "rw-s 00000000 00:01 0 /SYSV00000000 (deleted)";
+    const std::string anonymous = "rw-p 00000000 00:00 0";
+    const std::string kernelFile = "rw-s 00000000 00:0e 9 anon_inode:[io_uring]";
+
+    EXPECT_EQ(identity(file, 10), identity(file, 11));
+    EXPECT_NE(identity(file, 10), identity("r--p 00001000 fe:01 9 /usr/lib/libx.so", 10));
+    EXPECT_NE(identity(anonymous, 10), identity(anonymous, 11));
+    EXPECT_EQ(identity(segment, 10), identity(segment, 11));
+    EXPECT_NE(identity(segment, 10, 1), identity(segment, 10, 2)) << "another IPC namespace";
+    EXPECT_NE(identity(segment, 10), identity("rw-s 00000000 00:01 0 /memfd:a (deleted)", 10));
+    EXPECT_NE(identity(kernelFile, 10), identity(kernelFile, 11)) << "the inode is that of the whole kind";
+    for (const std::string& line : {file, segment, anonymous, kernelFile}) {
+        EXPECT_NE(identity(line, 10) >> 63U, 0U) << "apart from the small numbers of kernel objects";
+    }
+}
+
+TEST_F(AddressSpaceTest, WrittenCopiesOfAFileBelongToTheirProcess) {
+    const std::string smaps =
+        "100000-200000 rw-p 00001000 fe:00 9 /usr/lib/libx.so\nRss: 8 kB\nAnonymous: 4 kB\n";
+    EXPECT_NE(only(smaps, 10).info.object_id_full, only(smaps, 11).info.object_id_full);
+}
+
+TEST_F(AddressSpaceTest, NeighboursTellArenasStacksAndGuards) {
+    const AddressSpace space = build(
+        // An arena of the C library in use, with its reserve; a whole one.
+        "7f0000000000-7f0000021000 rw-p 00000000 00:00 0\nRss: 4 kB\n"
+        "7f0000021000-7f0004000000 ---p 00000000 00:00 0\n"
+        "7f0008000000-7f000c000000 rw-p 00000000 00:00 0\nRss: 4 kB\n"
+        // A thread's stack above its guard, then memory that just follows it.
+        "7f0010000000-7f0010001000 ---p 00000000 00:00 0\n"
+        "7f0010001000-7f0010801000 rw-p 00000000 00:00 0\nRss: 4 kB\nVmFlags: rd wr nh \n"
+        "7f0010801000-7f0010802000 rw-p 00000000 00:00 0\nRss: 4 kB\n"
+        // Inaccessible memory beside nothing; a page above a large reservation.
+        "7f0020000000-7f0020001000 ---p 00000000 00:00 0\n"
+        "7f0030000000-7f0040001000 ---p 00000000 00:00 0\n"
+        "7f0040001000-7f0040101000 rw-p 00000000 00:00 0\nRss: 4 kB\n");
+    std::vector<uint32_t> tags;
+    for (const auto& region : space.regions()) {
+        tags.push_back(region.info.user_tag);
+    }
+    EXPECT_EQ(tags,
+              (std::vector<uint32_t>{MWTagMallocArena, MWTagMallocReserve, MWTagMallocArena, MWTagStackGuard,
+                                     MWTagThreadStack, MWTagNone, MWTagGuard, MWTagGuard, MWTagNone}));
+}
+
+TEST_F(AddressSpaceTest, NamesThatProgramsGiveBecomeTags) {
+    const AddressSpace space = build(
+        "1000-2000 rw-p 00000000 00:00 0 [anon:Arena]\nRss: 4 kB\n"
+        "2000-3000 rw-s 00000000 00:01 3 [anon_shmem:Frames]\nRss: 4 kB\n"
+        "3000-4000 rw-p 00000000 00:00 0 [anon:Arena]\nRss: 4 kB\n"
+        "4000-5000 rw-p 00000000 00:00 0 [anon:]\nRss: 4 kB\n");
+    const auto& regions = space.regions();
+    EXPECT_EQ(_names.nameForTag(regions[0].info.user_tag), "Arena");
+    EXPECT_EQ(_names.nameForTag(regions[1].info.user_tag), "Frames");
+    EXPECT_EQ(regions[2].info.user_tag, regions[0].info.user_tag);
+    EXPECT_EQ(regions[3].info.user_tag, MWTagNone);
+    EXPECT_EQ(regions[1].backing, Backing::shmem);
+
+    for (int extra = 0; extra < 200; ++extra) {
+        const uint32_t tag = _names.tagForName("extra " + std::to_string(extra));
+        EXPECT_TRUE(tag == MWTagNone || _names.nameForTag(tag) == "extra " + std::to_string(extra));
+        EXPECT_LE(tag, MWTagLastDynamic);
+    }
+}
+
+TEST_F(AddressSpaceTest, FindsTheRegionAtOrAboveAnAddress) {
+    const AddressSpace space = build("2000-4000 rw-p 00000000 00:00 0\n8000-9000 rw-p 00000000 00:00 0\n");
+    const auto startAt = [&](uint64_t address) {
+        const AddressSpaceRegion* region = space.regionAtOrAbove(address);
+        return region == nullptr ? 0 : region->start;
+    };
+    EXPECT_EQ(startAt(0), 0x2000U);
+    EXPECT_EQ(startAt(0x3fff), 0x2000U);
+    EXPECT_EQ(startAt(0x4000), 0x8000U);
+    EXPECT_EQ(startAt(0x9000), 0U);
+}
+
+}  // namespace

@@ -1,0 +1,295 @@
+#include "platform/linux/MWLinuxHost.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <linux/sched.h>
+#include <cerrno>
+#include <csignal>
+#include <fstream>
+#include <thread>
+
+#include "platform/MWRegionTags.h"
+#include "support/ChildProcess.h"
+
+namespace {
+
+constexpr uint64_t kPage = 4096;
+
+uint64_t mapPages(size_t pages, int flags, int descriptor = -1) {
+    void* address = mmap(nullptr, pages * kPage, PROT_READ | PROT_WRITE, flags, descriptor, 0);
+    return reinterpret_cast<uint64_t>(address);
+}
+
+void touch(uint64_t address, std::initializer_list<size_t> pages) {
+    for (const size_t page : pages) {
+        *reinterpret_cast<volatile char*>(address + page * kPage) = 1;
+    }
+}
+
+/// A task on a live host, released at the end.
+class LiveTask {
+public:
+    LiveTask(MWLinuxHost& host, pid_t pid) : _host(host) { _code = host.task_read_for_pid(pid, _task); }
+    ~LiveTask() { _host.task_release(_task); }
+    LiveTask(const LiveTask&) = delete;
+    LiveTask& operator=(const LiveTask&) = delete;
+
+    kern_return_t code() const { return _code; }
+    task_t handle() const { return _task; }
+
+    /// The region that holds `address`; its start is 0 when none does.
+    struct Region {
+        uint64_t start = 0;
+        uint64_t size = 0;
+        vm_region_submap_info_64 info;
+    };
+    Region at(uint64_t address) const {
+        Region region = {.start = address, .size = 0, .info = {}};
+        uint32_t depth = 0;
+        uint32_t words = VM_REGION_SUBMAP_INFO_COUNT_64;
+        EXPECT_EQ(_host.mach_vm_region_recurse(_task, region.start, region.size, depth, region.info, words),
+                  KERN_SUCCESS);
+        return region.start <= address ? region : Region{};
+    }
+
+    kern_return_t walkCode() const {
+        uint64_t address = 0;
+        uint64_t size = 0;
+        uint32_t depth = 0;
+        uint32_t words = VM_REGION_SUBMAP_INFO_COUNT_64;
+        vm_region_submap_info_64 info;
+        return _host.mach_vm_region_recurse(_task, address, size, depth, info, words);
+    }
+
+private:
+    MWLinuxHost& _host;
+    task_t _task = 0;
+    kern_return_t _code;
+};
+
+TEST(LinuxHost, CountsExactlyThePagesThatWereTouched) {
+    const ChildProcess child([] {
+        const uint64_t address = mapPages(20, MAP_PRIVATE | MAP_ANONYMOUS);
+        madvise(reinterpret_cast<void*>(address), 20 * kPage, MADV_NOHUGEPAGE);
+        touch(address, {0, 7, 19});
+        return address;
+    });
+    MWLinuxHost host;
+    const LiveTask task(host, child.pid());
+    const auto region = task.at(child.answer());
+    EXPECT_EQ(region.start, child.answer());
+    EXPECT_EQ(region.size, 20 * kPage);
+    EXPECT_EQ(region.info.pages_resident, 3U);
+    EXPECT_EQ(region.info.pages_dirtied, 3U);
+    EXPECT_EQ(region.info.share_mode, SM_PRIVATE);
+
+    std::vector<int32_t> words(20);
+    uint64_t count = words.size();
+    ASSERT_EQ(host.mach_vm_page_range_query(task.handle(), region.start, region.size, words, count),
+              KERN_SUCCESS);
+    for (size_t page = 0; page < words.size(); ++page) {
+        const bool touched = page == 0 || page == 7 || page == 19;
+        EXPECT_EQ(words[page], touched ? VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY : 0) << page;
+    }
+}
+
+TEST(LinuxHost, SharedMemoryIsOneObjectAndPrivateMemoryIsNot) {
+    const int memfd = memfd_create("object", MFD_CLOEXEC);
+    ASSERT_EQ(ftruncate(memfd, 8 * kPage), 0);
+    const auto mapMemfd = [&] {
+        const uint64_t address = mapPages(8, MAP_SHARED, memfd);
+        touch(address, {1, 2});
+        return address;
+    };
+    const auto mapPrivate = [] {
+        const uint64_t address = mapPages(8, MAP_PRIVATE | MAP_ANONYMOUS);
+        touch(address, {1, 2});
+        return address;
+    };
+    const ChildProcess first(mapMemfd);
+    const ChildProcess second(mapMemfd);
+    const ChildProcess third(mapPrivate);
+    const ChildProcess fourth(mapPrivate);
+    close(memfd);
+
+    MWLinuxHost host;
+    const auto regionOf = [&](const ChildProcess& child) {
+        return LiveTask(host, child.pid()).at(child.answer());
+    };
+    EXPECT_EQ(regionOf(first).info.object_id_full, regionOf(second).info.object_id_full);
+    EXPECT_EQ(regionOf(first).info.user_tag, MWTagMemfd);
+    EXPECT_EQ(regionOf(first).info.pages_dirtied, 2U);
+    EXPECT_EQ(regionOf(first).info.external_pager, 0U);
+    EXPECT_NE(regionOf(third).info.object_id_full, regionOf(fourth).info.object_id_full);
+}
+
+TEST(LinuxHost, MappedFilesHaveTheirPath) {
+    const std::string path = testing::TempDir() + "a b\n(deleted)";
+    std::ofstream(path) << std::string(4 * kPage, 'x');
+    const int file = open(path.c_str(), O_RDWR | O_CLOEXEC);
+    ASSERT_GE(file, 0);
+    const ChildProcess child([&] {
+        const uint64_t address = mapPages(4, MAP_SHARED, file);
+        touch(address, {3});
+        return address;
+    });
+    close(file);
+    MWLinuxHost host;
+    const LiveTask task(host, child.pid());
+    struct stat status = {};
+    ASSERT_EQ(stat(path.c_str(), &status), 0);
+    unlink(path.c_str());
+    const auto region = task.at(child.answer());
+    if (region.info.external_pager == 0) {
+        GTEST_SKIP() << "the temporary directory is a tmpfs";
+    }
+    std::array<char, 1024> name = {};
+    const int length = host.proc_regionfilename(child.pid(), child.answer(), name);
+    EXPECT_EQ(std::string(name.data(), static_cast<size_t>(length)), path);
+    EXPECT_EQ(region.info.share_mode, SM_SHARED);
+    EXPECT_GE(region.info.pages_dirtied, 1U);
+}
+
+TEST(LinuxHost, AProcessThatEndedHasNoAddressSpace) {
+    ChildProcess child;
+    MWLinuxHost host;
+    const LiveTask task(host, child.pid());
+    EXPECT_EQ(task.walkCode(), KERN_SUCCESS);
+    proc_bsdshortinfo record = {};
+
+    child.kill();
+    const LiveTask zombie(host, child.pid());
+    EXPECT_EQ(zombie.code(), KERN_SUCCESS) << "a zombie can be named, its memory is gone";
+    EXPECT_EQ(zombie.walkCode(), MACH_SEND_INVALID_DEST);
+    EXPECT_EQ(host.proc_pidinfo(child.pid(), record), static_cast<int>(sizeof(record)));
+    EXPECT_EQ(record.pbsi_status, SZOMB);
+
+    child.reap();
+    EXPECT_EQ(zombie.walkCode(), MACH_SEND_INVALID_DEST);
+    errno = 0;
+    EXPECT_LT(host.proc_pidinfo(child.pid(), record), 0);
+    EXPECT_EQ(errno, ESRCH);
+    EXPECT_EQ(LiveTask(host, child.pid()).code(), KERN_FAILURE);
+}
+
+// The successor is made with the pid of its predecessor, which only root may ask for.
+TEST(LinuxHost, ATaskNeverReadsAnotherProcessOfItsPid) {
+    ChildProcess first;
+    MWLinuxHost host;
+    const LiveTask task(host, first.pid());
+    first.reap();
+    pid_t wanted = first.pid();
+    clone_args arguments = {};
+    arguments.exit_signal = SIGCHLD;
+    arguments.set_tid = reinterpret_cast<uint64_t>(&wanted);
+    arguments.set_tid_size = 1;
+    const long successor = syscall(SYS_clone3, &arguments, sizeof(arguments));
+    if (successor == 0) {
+        pause();
+        _exit(0);
+    }
+    if (successor < 0) {
+        GTEST_SKIP() << "not allowed to choose a pid";
+    }
+    ASSERT_EQ(successor, wanted);
+    EXPECT_EQ(task.walkCode(), MACH_SEND_INVALID_DEST);
+    EXPECT_EQ(LiveTask(host, wanted).walkCode(), KERN_SUCCESS);
+    kill(wanted, SIGKILL);
+    waitpid(wanted, nullptr, 0);
+}
+
+TEST(LinuxHost, AProcessLivesOnInItsOtherThreads) {
+    // The first thread of a program ends once it has started another one.
+    const pid_t pid = fork();
+    if (pid == 0) {
+        std::thread([] { pause(); }).detach();
+        syscall(SYS_exit, 0);
+    }
+    MWLinuxHost host;
+    proc_bsdshortinfo record = {};
+    std::string state;
+    while (state.empty() || state.front() != 'Z') {
+        std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+        stat >> state >> state >> state;
+    }
+    EXPECT_EQ(LiveTask(host, pid).walkCode(), KERN_SUCCESS);
+    EXPECT_EQ(host.proc_pidinfo(pid, record), static_cast<int>(sizeof(record)));
+    EXPECT_NE(record.pbsi_status, SZOMB);
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+}
+
+TEST(LinuxHost, ListsProcessesAndTheKernelButNoKernelThreads) {
+    const ChildProcess child;
+    MWLinuxHost host;
+    std::vector<int32_t> pids(static_cast<size_t>(host.proc_listallpids({})) + 20);
+    pids.resize(static_cast<size_t>(host.proc_listallpids(pids)));
+    EXPECT_TRUE(std::is_sorted(pids.begin(), pids.end()));
+    EXPECT_EQ(pids.front(), 0);
+    EXPECT_TRUE(std::binary_search(pids.begin(), pids.end(), child.pid()));
+    for (const int32_t pid : pids) {
+        std::ifstream comm("/proc/" + std::to_string(pid) + "/comm");
+        std::string name;
+        EXPECT_FALSE(std::getline(comm, name) && name == "kthreadd");
+    }
+    proc_bsdinfo record = {};
+    EXPECT_EQ(host.proc_pidinfo(0, record), 136);
+    EXPECT_EQ(record.pbi_flags & PROC_FLAG_SYSTEM, PROC_FLAG_SYSTEM);
+    EXPECT_EQ(host.proc_pidinfo(child.pid(), record), 136);
+    EXPECT_EQ(record.pbi_flags, PROC_FLAG_LP64);
+    EXPECT_EQ(record.pbi_ppid, static_cast<uint32_t>(getpid()));
+}
+
+TEST(LinuxHost, ReadsTheKernelsOwnFigures) {
+    const ChildProcess child([] {
+        touch(mapPages(64, MAP_PRIVATE | MAP_ANONYMOUS), {0, 1, 2, 3, 4, 5, 6, 7});
+        return uint64_t{0};
+    });
+    MWLinuxHost host;
+    rusage_info_v5 usage;
+    ASSERT_EQ(host.proc_pid_rusage(child.pid(), usage), 0);
+    EXPECT_GT(usage.ri_phys_memweight, 8 * kPage);
+    EXPECT_GE(usage.ri_lifetime_max_phys_memweight, usage.ri_phys_memweight);
+
+    std::vector<ledger_template_info> names(2);
+    std::vector<ledger_entry_info> entries(2);
+    size_t filled = 0;
+    ASSERT_EQ(host.ledgerTemplate(names, filled), 0);
+    ASSERT_EQ(filled, 1U);
+    EXPECT_STREQ(names.front().lti_name.data(), "page_table");
+    ASSERT_EQ(host.ledgerEntries(child.pid(), entries, filled), 0);
+    EXPECT_GT(entries.front().lei_balance, 0);
+
+    std::vector<char> area(4096);
+    size_t length = 0;
+    ASSERT_EQ(host.sysctlArgumentArea(child.pid(), area, length), 0);
+    const std::string path(area.data() + sizeof(int32_t));
+    EXPECT_EQ(path.substr(path.rfind('/') + 1), "platform_tests");
+    EXPECT_EQ(host.sysctlArgumentArea(child.pid(), std::span(area).first(3), length), 0);
+    EXPECT_EQ(length, 3U) << "cut to the room there is";
+}
+
+TEST(LinuxHost, RemovesRegularFilesOnly) {
+    MWLinuxHost host;
+    const std::string file = testing::TempDir() + "memweight-file";
+    const std::string fifo = testing::TempDir() + "memweight-fifo";
+    std::ofstream(file) << "x";
+    ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+    EXPECT_TRUE(host.fileExists(file));
+    host.unlinkRegularFile(file);
+    host.unlinkRegularFile(fifo);
+    host.unlinkRegularFile("/dev/null");
+    EXPECT_FALSE(host.fileExists(file));
+    EXPECT_TRUE(host.fileExists(fifo));
+    EXPECT_TRUE(host.fileExists("/dev/null"));
+    unlink(fifo.c_str());
+}
+
+}  // namespace
