@@ -5,6 +5,7 @@
 #include <memory>
 #include <nlohmann/json_fwd.hpp>
 #include <string>
+#include <utility>
 
 /// An element of the auxiliary-data tree: a value or a container. Immutable and shared: a merge result may
 /// hold the very elements of its inputs.
@@ -18,9 +19,10 @@ public:
 using MWAuxDatum = std::shared_ptr<const MWAuxDataType>;
 
 /// A number, in bytes for every producer of this program.
-class MWAuxData : public MWAuxDataType {
+class MWAuxData final : public MWAuxDataType {
 public:
-    /// `shouldAggregate`: whether values of one name are added up over processes. (initWithValue:shouldAggregate:)
+    /// `shouldAggregate`: whether values of one name are added up over processes.
+    /// (initWithValue:shouldAggregate:)
     MWAuxData(int64_t value, bool shouldAggregate) : _aggregate(shouldAggregate), _value(value) {}
 
     int64_t value() const { return _value; }
@@ -34,7 +36,7 @@ private:
 };
 
 /// Named elements. Under one name every producer puts either always a container or always a value.
-class MWAuxDataContainer : public MWAuxDataType {
+class MWAuxDataContainer final : public MWAuxDataType {
 public:
     using Elements = std::map<std::string, MWAuxDatum>;
 

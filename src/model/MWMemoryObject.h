@@ -34,7 +34,9 @@ public:
     /// Every region added, in the order added.
     const MWMemoryRegionList& memoryRegions() const { return *_memoryRegions; }
     /// The regions of each process that can have a view of its own; absent where no view differs.
-    const std::optional<MWProcessMemoryRegions>& processMemoryRegions() const { return _processMemoryRegions; }
+    const std::optional<MWProcessMemoryRegions>& processMemoryRegions() const {
+        return _processMemoryRegions;
+    }
     /// Merged page ranges of the counted regions; none once finalized.
     const MWRangeList* rangeList() const { return _rangeList.get(); }
 
@@ -62,6 +64,11 @@ public:
 private:
     void _addRegion(const std::shared_ptr<MWMemoryRegion>& region, uint64_t pageSize,
                     const MWRegionHolder* forProcess);
+    void _raiseToLargestProcess();
+    bool _everyProcessSeesWholeObject() const;
+    void _nameFakeRegions();
+    std::shared_ptr<const MWMemoryObject> _viewOfRegions(const MWMemoryRegionList& regions,
+                                                         const MWRegionHolder& process) const;
 
     uint64_t _totalDirtySize = 0;
     uint64_t _totalCleanSize = 0;

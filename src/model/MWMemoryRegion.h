@@ -5,8 +5,10 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include "model/MWRangeList.h"
+#include "platform/MWHostRecords.h"
 
 class MWMemoryObject;
 
@@ -98,7 +100,7 @@ public:
     /// Whether a page-exact breakdown is worth taking: a shareable region of more than one page whose pages
     /// are of mixed kinds.
     bool eligibleForSubrangesUsingPageSize(uint64_t pageSize) const;
-    bool isFake() const { return _user_tag == 0xFFFFFFFF; }
+    bool isFake() const { return _user_tag == MWFakeRegionTag; }
 
     /// The category under which a region of this tag is reported; never empty.
     static std::string categoryNameForTag(uint32_t tag);

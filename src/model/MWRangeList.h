@@ -42,7 +42,9 @@ public:
     MWRangeList(const MWRangeList&) = delete;
     MWRangeList& operator=(const MWRangeList&) = delete;
 
-    /// `memoryTotal.regions` is ignored. `pageSize` is a power of two.
+    /// `memoryTotal.regions` is ignored. A page size of 0, as a damaged snapshot may have, rounds nothing.
+    /// Costs the walk to the span's place: constant when spans come in ascending order, else up to the whole
+    /// list.
     void addRange(MWSubrange range, uint64_t pageSize, const MWCategoryTotals& memoryTotal);
     /// The region's sub-ranges when it has them, else its whole span of its object.
     void addRegion(const MWMemoryRegion& region, uint64_t pageSize);
@@ -55,5 +57,12 @@ public:
     const MWRangeListNode* head() const { return _rangeListHead; }
 
 private:
+    /// The link (head or `next`) behind the last node that ends before `firstPage` without touching it.
+    MWRangeListNode*& _linkBehindNodesBefore(uint64_t firstPage, uint64_t pageSize);
+
     MWRangeListNode* _rangeListHead = nullptr;
+    /// The node before the last added one, none at the head. A later span that it also lies before is placed
+    /// from here, since all nodes in front of it lie before that span too. An addition frees no node up to
+    /// it.
+    MWRangeListNode* _lastPredecessor = nullptr;
 };
