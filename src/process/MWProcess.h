@@ -109,7 +109,7 @@ protected:
 
     /// Takes identity, name and page size from the record and acquires the task; false where that is refused.
     /// `pid` may be set before. (The failing half of initWithBsdInfo:)
-    bool _initWithBsdInfo(const proc_bsdinfo& info);
+    virtual bool _initWithBsdInfo(const proc_bsdinfo& info);
     void _setIdleExitStatus(MWIdleExitStatus status) { _idleExitStatus = status; }
     void _addError(std::string message) { _errors.push_back(std::move(message)); }
     void _addWarning(std::string message) { _warnings.push_back(std::move(message)); }

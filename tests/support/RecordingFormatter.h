@@ -46,14 +46,17 @@ public:
     RecordingFormatter(std::string name, std::vector<std::string>& log) : _name(std::move(name)), _log(log) {}
 
     void printProcessHeader(const MWProcess& process) override { _line("header " + process.displayString()); }
-    void endProcessHeader(const MWProcess& process) override { _line("endHeader " + process.displayString()); }
+    void endProcessHeader(const MWProcess& process) override {
+        _line("endHeader " + process.displayString());
+    }
     void printProcessTotal(uint64_t memweight, const MWProcess& forProcess) override {
         _line("total " + std::to_string(memweight) + " of " + forProcess.displayString());
     }
     void printProcessCategories(const MWCategoryTable& categories, const MWCategoryTotals& total) override {
         _line("private {" + describe(categories) + "} = " + describe(total));
     }
-    void printSharedCategories(const MWCategoryTable& categories, const MWSharedCategoriesCall& call) override {
+    void printSharedCategories(const MWCategoryTable& categories,
+                               const MWSharedCategoriesCall& call) override {
         _line("shared" + _names(call.sharedWith.processes()) + " for " + call.forProcess.name() +
               (call.hasProcessView ? " own view" : "") + " {" + describe(categories) +
               "} = " + describe(call.total));
@@ -73,8 +76,11 @@ public:
     }
     void printGlobalAuxData(const MWAuxDataTree& auxData) override { _line("globalAux" + _text(auxData)); }
     void endAtTime(const MWTime& time) override { _line("end " + std::to_string(time.machAbsoluteTime())); }
-    void startAtTime(const MWTime& time) override { _line("start " + std::to_string(time.machAbsoluteTime())); }
-    void printSpanlistLikeOutputForProcess(const MWProcess& process, const MWMemoryRegionList& regions) override {
+    void startAtTime(const MWTime& time) override {
+        _line("start " + std::to_string(time.machAbsoluteTime()));
+    }
+    void printSpanlistLikeOutputForProcess(const MWProcess& process,
+                                           const MWMemoryRegionList& regions) override {
         _line("listing " + process.name() + " " + std::to_string(regions.size()));
     }
 

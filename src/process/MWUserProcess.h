@@ -1,0 +1,194 @@
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+
+#include "platform/MWHostRecords.h"
+#include "process/MWImage.h"
+#include "process/MWProcess.h"
+
+/// One region as the walk reports it.
+struct MWWalkedRegion {
+    uint64_t address = 0;
+    uint64_t size = 0;
+    vm_region_submap_info_64 info = {};
+    int32_t purgeState = VM_PURGABLE_DENY;
+    std::optional<std::string> path = {};  ///< of the mapped file
+    std::optional<std::string> name = {};  ///< given by the source of the regions; a live walk gives none
+    bool verbose = false;
+};
+
+/// Answers whether the walk must stop.
+using MWRegionCallback = std::function<bool(const MWWalkedRegion&)>;
+
+/// The disposition words of consecutive pages; chunk `index` of `count`.
+struct MWDispositionChunk {
+    std::span<const int32_t> words;
+    uint64_t index;
+    uint64_t count;
+};
+
+struct MWDispositionQuery {
+    uint64_t pagesToQuery;
+    std::function<void(const MWDispositionChunk&)> block;
+};
+
+struct MWSharedRegionMapping {
+    uint64_t forRegionInSharedRegionStartingAt;
+    uint64_t withSize;
+    const vm_region_submap_info_64& withRegionInfo;
+    MWImageEnumerator& imageEnumerator;
+};
+
+struct MWExpectedError {
+    kern_return_t expectingErrorOnExit;
+};
+
+/// Where a platform keeps its rtld shared cache.
+enum MWPlatformCode : int {
+    MWPlatformX86 = 0,
+    MWPlatformX86_64 = 1,
+    MWPlatformArm = 2,
+    MWPlatformArm64 = 3,
+    MWPlatformArm64_32 = 4,
+    MWPlatformUnknown = 5,
+    MWPlatformNoSharedCache = 6,
+};
+
+/// Kernel objects that a process owns, by object identifier.
+using MWOwnedObjects = std::map<uint64_t, OwnedObjectRecord>;
+
+/// A live user process. Holds its task from creation to destruction. Gathering walks the address space once
+/// and turns every region record into a region; what the kernel refuses becomes a message of the process.
+///
+/// Every step can be replaced, for processes whose data comes from elsewhere.
+class MWUserProcess : public MWProcess {
+public:
+    /// None when the task is refused; the reason is then already on standard error.
+    static std::shared_ptr<MWUserProcess> initWithBsdInfo(const proc_bsdinfo& info);
+    ~MWUserProcess() override;
+    MWUserProcess(const MWUserProcess&) = delete;
+    MWUserProcess& operator=(const MWUserProcess&) = delete;
+
+    /// Does nothing for a process that has its regions.
+    void gatherData() override;
+    bool _isAlive() const override { return true; }
+    bool _populateTask() override;
+
+protected:
+    MWUserProcess() = default;
+
+    bool _initWithBsdInfo(const proc_bsdinfo& info) override;
+    /// A live process runs as what it is on this platform.
+    virtual void _gatherIsTranslated() {}
+    /// False: the page size of the data is unusable and the process is skipped.
+    virtual bool _configurePageSize() { return true; }
+
+    // Figures of the kernel that no region shows.
+
+    /// Nothing yet: there is no consumer of the physical charge so far.
+    virtual void _gatherPhysMemweight() {}
+    /// Nothing yet: the kernel's ledgers are not read so far, so no page tables are charged.
+    virtual void _gatherLedgers() {}
+    /// None: the kernel does not list owned objects, or is not asked to.
+    virtual std::optional<MWOwnedObjects> _gatherOwnedVmObjects() { return std::nullopt; }
+    virtual void _gatherIdleExitStatus();
+    virtual void _setIdleExitStatusFromDirtyFlags(uint32_t flags);
+
+    // Images and the rtld shared cache.
+
+    /// Fills `_images`. Nothing yet: images are not listed so far, so no region has an image's name.
+    virtual void _gatherImageData() {}
+    /// Chooses the shared cache's place by platform; false for MWPlatformUnknown.
+    virtual bool _setSharedRegionFromPlatform(int platformCode);
+    /// Appends the pieces of one shared-cache mapping to `regions`; false when it could not be measured.
+    virtual bool _addRegionsToArray(MWMemoryRegionList& regions, const MWSharedRegionMapping& mapping);
+    bool _isInSharedCache(uint64_t address) const { return address - _sharedRegionBase < _sharedRegionSize; }
+
+    // The region walk.
+
+    /// Calls back once for every region, by ascending address; a submap's regions are reported in its
+    /// place, but a shared-cache mapping whole. Costs one kernel query per region.
+    virtual void enumerateRegions(const MWRegionCallback& callback);
+    /// The start of the last region below the shared cache, to 16 MiB; 0 when there is no such boundary.
+    virtual uint64_t _lastNonSharedCacheRegion();
+
+    // Page dispositions.
+
+    /// Calls back with the disposition words of the pages from `startAddress` on, at most 4096 at a time.
+    /// False when a query failed; the failure is filed and what was delivered before stays delivered.
+    virtual bool _enumerateDispositionChunksWithStartAddr(uint64_t startAddress,
+                                                          const MWDispositionQuery& query);
+    /// Sets the dirty and swapped sizes of a shared-cache region, which are 0, from its pages. A page that
+    /// two neighbours share is queried once and each is charged its own bytes of it, so neighbours come in
+    /// ascending order.
+    virtual bool _populateMemoryRegionWithPageQueries(const std::shared_ptr<MWMemoryRegion>& region,
+                                                      const vm_region_submap_info_64& regionInfo);
+    /// Records page-exact runs of one kind in the region's sub-range list. Exclusively owned memory has none:
+    /// nobody else can see another part of it.
+    virtual void _addSubrangesForRegion(MWMemoryRegion& region, int32_t purgeState);
+
+    /// Walks the regions and settles what is owned without being mapped; sets `memoryRegions`.
+    virtual void _gatherMemoryData();
+
+    // Messages.
+
+    /// Files a kernel failure: as a warning when it is the one to expect of an exiting process and the
+    /// process is gone indeed, else as an error.
+    virtual void _processMachVMError(kern_return_t result, MWExpectedError expected);
+    /// Prints and files a warning with the text of errno.
+    virtual void _addErrnoWarningWithDescription(std::string_view description);
+    void _printBailingOut() const;
+
+    // What the steps share.
+
+    std::optional<task_t> _task;
+    uint64_t _sharedRegionBase = 0;
+    uint64_t _sharedRegionSize = 0;
+    uint32_t _sharedRegionAlignmentSize = 0;  ///< of images inside the shared cache
+    /// Bytes of page tables.
+    std::array<uint64_t, 1> _ledgers = {};
+    /// Present only while gathering.
+    std::shared_ptr<MWImageList> _images;
+    /// Absent where the kernel did not tell. Mapped regions claim their entries while regions are gathered.
+    std::optional<MWOwnedObjects> _ownedVmObjects;
+    /// The last page of the region measured last, when the region ends within it.
+    uint64_t _cachedDispositionAddress = 0;
+    int32_t _cachedDisposition = 0;
+    /// A shared-cache gap whose share of its last page awaits the disposition of that page.
+    std::shared_ptr<MWMemoryRegion> _pendingUnusedSharedRegion;
+
+private:
+    struct MemoryGathering;
+    struct SharedPageCharge;
+    enum class WalkStep : uint8_t { end, region, sharedMapping, notShared };
+
+    int _platformCode() const;
+
+    // Classification of one walked region; `gathering` is the state of the walk so far.
+    bool _classifyRegion(MemoryGathering& gathering, const MWWalkedRegion& walked);
+    bool _classifySharedCacheMapping(MemoryGathering& gathering, const MWWalkedRegion& walked);
+    void _setSizes(MWMemoryRegion& region, const MWWalkedRegion& walked, bool breakDown) const;
+    void _nameRegion(MemoryGathering& gathering, MWMemoryRegion& region, const MWWalkedRegion& walked);
+    void _matchOwnedObject(MemoryGathering& gathering, MWMemoryRegion& region, const MWWalkedRegion& walked);
+    void _appendLeftoverOwnedObjects(MWMemoryRegionList& regions);
+    void _settleHolder(MemoryGathering& gathering);
+
+    // One step of the walk: each fills `region` with the first region at or above its address.
+    WalkStep _nextRegion(uint64_t boundary, MWWalkedRegion& region);
+    WalkStep _querySharedMapping(uint64_t boundary, MWWalkedRegion& region);
+    WalkStep _queryRecursively(MWWalkedRegion& region);
+    WalkStep _endWalk(kern_return_t result, std::string_view label);
+    bool _leadsOnFrom(uint64_t address, const MWWalkedRegion& region);
+    void _gatherRegionDetails(MWWalkedRegion& region) const;
+
+    void _chargeSharedPage(SharedPageCharge& measured, int32_t word);
+    void _creditPendingGap(const MWMemoryRegion& nextRegion, int32_t word);
+};

@@ -1,0 +1,51 @@
+#include "process/MWImage.h"
+
+#include <gtest/gtest.h>
+
+#include "model/MWMemoryRegion.h"
+
+namespace {
+
+MWImage image(uint64_t start, uint64_t end, const std::string& name = "__DATA") {
+    MWImage result;
+    result.setStart(start);
+    result.setSize(end - start);
+    result.setName(name);
+    return result;
+}
+
+TEST(MWImageTest, KindFollowsSegmentName) {
+    const std::vector<std::pair<std::string, uint8_t>> kinds = {
+        {"__TEXT", SegmentText},         {"__TEXT_EXEC", SegmentText}, {"__OBJC_RO", SegmentText},
+        {"__OBJC_RW", SegmentData},      {"__DATA", SegmentData},      {"__DATA_CONST", SegmentData},
+        {"__LINKEDIT", SegmentLinkedit}, {"_TEXT", SegmentNone},       {"unknown", SegmentNone}};
+    for (const auto& [name, kind] : kinds) {
+        EXPECT_EQ(image(0, 1, name).segment(), kind) << name;
+    }
+    MWImage renamed = image(0, 1, "__LINKEDIT");
+    renamed.setName("unknown");
+    EXPECT_EQ(renamed.segment(), SegmentLinkedit);
+}
+
+TEST(MWImageTest, EnumeratorFindsOverlapAndLeavesBehindWhatIsBelow) {
+    const auto images =
+        std::make_shared<const MWImageList>(MWImageList{image(0x1000, 0x2000), image(0x3000, 0x4000)});
+    struct Search {
+        uint64_t start;
+        uint64_t end;
+        uint64_t found;  ///< start of the image, 0 for none
+    };
+    const auto run = [&](const std::vector<Search>& searches) {
+        MWImageEnumerator enumerator(images);
+        for (const Search& search : searches) {
+            const MWImage* found = enumerator.nextImageForStart(search.start, {.end = search.end});
+            EXPECT_EQ(found == nullptr ? 0 : found->start(), search.found)
+                << std::hex << search.start << " to " << search.end;
+        }
+    };
+    run({{0x2000, 0x2800, 0}, {0x2800, 0x3800, 0x3000}, {0x3800, 0x5000, 0x3000}, {0x4000, 0x5000, 0}});
+    run({{0, 0x1000, 0}, {0, 0x1001, 0x1000}, {0, 0x9000, 0x1000}, {0x1FFF, 0x2000, 0x1000}});
+    run({{0x2000, 0x2800, 0}, {0x1000, 0x2000, 0}});  // going back finds nothing any more
+}
+
+}  // namespace
