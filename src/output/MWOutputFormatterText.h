@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "output/MWDateFormatter.h"
 #include "output/MWOutputFormatter.h"
 
 /// The size style of the text report.
@@ -29,9 +30,78 @@ struct MWTextStyle {
     std::string sort;
 };
 
-/// The human-readable report, on a stream that it borrows (standard output in the program).
+/// The human-readable report, on a stream that it borrows (standard output in the program). Write errors are
+/// ignored. A measurement of a single process gets neither a summary table nor global auxiliary data. Names,
+/// paths and messages are printed as MWTerminalText.
 class MWOutputFormatterText : public MWOutputFormatter {
 public:
+    /// (initWithSummaryFormat:options:sort:)
     explicit MWOutputFormatterText(MWTextStyle style, std::FILE* output = stdout);
-    // (the implementer adds the overrides and the internal operations)
+
+    void printProcessHeader(const MWProcess& process) override;
+    void endProcessHeader(const MWProcess& process) override;
+    void printProcessTotal(uint64_t memweight, const MWProcess& forProcess) override;
+    void printProcessCategories(const MWCategoryTable& categories, const MWCategoryTotals& total) override;
+    void printSharedCategories(const MWCategoryTable& categories,
+                               const MWSharedCategoriesCall& call) override;
+    void printProcessAuxData(const MWAuxDataTree& auxData) override;
+    void printProcessesWithWarnings(const std::vector<const MWProcess*>& processes,
+                                    const MWProcessErrors& errors) override;
+    void printSummaryCategories(const MWCategoryTable& categories, const MWSummaryCall& call) override;
+    void printGlobalAuxData(const MWAuxDataTree& auxData) override;
+    void endAtTime(const MWTime& time) override;
+    void startAtTime(const MWTime& time) override;
+    void configureForMultipleOutputs() override { _multipleOutputs = true; }
+
+    // Internal operations.
+
+    /// A size in the configured style; in pages of the process whose header was printed last.
+    std::string formattedStringForSize(uint64_t size) const;
+    /// "/usr/lib/libx.so" as ".../libx.so", unless full paths are on; otherwise unchanged.
+    std::optional<std::string> _truncatedNameForString(const std::optional<std::string>& string) const;
+    /// The table's keys in report order; rows that are equal in every compared value stand in order of key.
+    std::vector<std::string> _sortedKeysForCategories(const MWCategoryTable& categories) const;
+
+private:
+    /// One text for each size column that can be shown.
+    struct SizeTexts {
+        std::string dirty;
+        std::string swapped;
+        std::string clean;
+        std::string reclaimable;
+        std::string wired;
+    };
+
+    bool _shows(MWTextOptions option) const { return (_options & option) != 0; }
+    std::string _sizeColumns(const SizeTexts& texts) const;
+    void _printTable(const MWCategoryTable& categories, const MWCategoryTotals& total) const;
+    void _printTableHeader() const;
+    void _printDashes() const;
+    void _printCategories(const MWCategoryTable& categories) const;
+    void _printTotalFooter(const MWCategoryTotals& total) const;
+    void _printRow(const MWCategoryTotals& total, std::string_view category, std::string_view detail) const;
+
+    void _printSeparator(const char* end) const;
+    void _printSharers(const MWSharedCategoriesCall& call) const;
+    void _printMessages(const char* heading, const std::vector<std::string>& messages) const;
+    void _printNames(const char* heading, const std::vector<const MWProcess*>& processes) const;
+    void _printPhysMemweightBreakdownEnabled() const;
+    void printAuxData(const MWAuxDataContainer& auxData) const;
+    void _printAuxData(const MWAuxDataContainer& auxData, size_t withIndent) const;
+
+    /// Headers printed in this measurement: 0, 1, or 2 for more than one.
+    uint8_t _processCount = 0;
+    /// Of the process whose header was printed last, in bytes.
+    uint64_t _pageSize = 0;
+    /// Headers of the optional columns that are shown.
+    std::optional<std::string> _swappedColumnName;
+    std::optional<std::string> _wiredColumnName;
+    bool _multipleOutputs = false;
+    MWDateFormatter _dateFormatter;
+    /// Rows marked verbose are shown; on for good once a region listing was printed.
+    bool _verbose = false;
+    MWSummaryFormat _summaryFormat;
+    MWTextOptions _options;
+    std::string _sort;
+    std::FILE* _output;
 };
