@@ -2,7 +2,10 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
+#include <set>
 #include <string>
+#include <vector>
 
 #include "platform/MWRegionTags.h"
 
@@ -10,12 +13,43 @@ namespace {
 
 constexpr uint64_t kPage = 4096;
 
+/// Pages written down by a test, by address; all others are absent.
+class WrittenPages : public PageSource {
+public:
+    std::map<uint64_t, PagemapEntry> pages;
+    std::set<uint64_t> zeroPages;
+
+    bool readPages(uint64_t address, std::span<PagemapEntry> entries) override {
+        for (PagemapEntry& entry : entries) {
+            const auto found = pages.find(address);
+            entry = found == pages.end() ? PagemapEntry{} : found->second;
+            address += kPage;
+        }
+        return true;
+    }
+    void clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) override {
+        for (PagemapEntry& entry : entries) {
+            entry.word = zeroPages.contains(address) ? 0 : entry.word;
+            address += kPage;
+        }
+    }
+    uint64_t nextPopulated(uint64_t address, uint64_t end) override {
+        const auto found = pages.lower_bound(address);
+        return found == pages.end() ? end : std::min(end, found->first);
+    }
+};
+
 /// Builds regions from the text of smaps, for a process on whose mounts nothing is tmpfs.
 class AddressSpaceTest : public testing::Test {
 protected:
     AddressSpace build(const std::string& smaps, int32_t pid = 10, uint64_t ipcNamespace = 1) {
         return {procfs::parseSmaps(smaps),
-                {.pid = pid, .startTime = 5, .ipcNamespace = ipcNamespace, .directory = -1},
+                {.pid = pid,
+                 .startTime = 5,
+                 .ipcNamespace = ipcNamespace,
+                 .directory = -1,
+                 .family = [this]() -> ForkFamily& { return _family; }},
+                _pages,
                 {_identity, _devices, _names, kPage}};
     }
 
@@ -28,6 +62,8 @@ protected:
     ObjectIdentity _identity{"0dd6b3ac-0f4b-4c3c-8b0f-5f5f1f0a6d11"};
     ShmemDevices _devices;
     RegionNames _names;
+    ForkFamily _family{.identifier = 77, .generations = {}};
+    WrittenPages _pages;
 };
 
 // KIND: what the mapping line says; TAG, SHARE MODE, PAGER: what the region says; DIRTY PAGES of 10 resident
@@ -42,7 +78,7 @@ struct KindRow {
 
 TEST_F(AddressSpaceTest, EachKindOfMapping) {
     const std::string counts =
-        "\nRss: 40 kB\nPrivate_Dirty: 12 kB\nAnonymous: 16 kB\nLazyFree: 4 kB\nSwap: 8 kB\nVmFlags: rd\n";
+        "\nRss: 40 kB\nPrivate_Dirty: 12 kB\nAnonymous: 16 kB\nLazyFree: 4 kB\nSwap: 8 kB\nSwapPss: 8 kB\nVmFlags: rd\n";
     for (const KindRow& row : {
              KindRow{"rw-p 00000000 00:00 0", MWTagNone, SM_PRIVATE, 0, 3},
              KindRow{"rw-p 00000000 00:00 0 [heap]", MWTagBrkHeap, SM_PRIVATE, 0, 3},

@@ -82,6 +82,12 @@ ObjectPlace placeOf(const BackedVma& backed, const AddressSpaceOwner& owner, con
     return own;
 }
 
+// Page-cache pages that a mapping counts as dirty: what its written copies leave of the count.
+uint64_t dirtyFileBytes(const Vma& vma) {
+    const uint64_t dirty = vma.sharedDirty + vma.privateDirty;
+    return dirty - std::min(vma.anonymous, dirty);
+}
+
 uint32_t pageCount(uint64_t bytes, uint64_t pageSize) {
     return static_cast<uint32_t>(std::min<uint64_t>(bytes / pageSize, UINT32_MAX));
 }
@@ -103,25 +109,165 @@ vm_region_submap_info_64 infoFor(const BackedVma& backed, uint64_t pageSize) {
     return info;
 }
 
-AddressSpaceRegion regionFor(BackedVma backed, const AddressSpaceOwner& owner,
-                             const AddressSpaceContext& context) {
-    Vma& vma = backed.vma;
-    AddressSpaceRegion region = {.start = vma.start,
-                                 .size = vma.size(),
-                                 .info = infoFor(backed, context.pageSize),
-                                 .backing = backed.backing};
-    const ObjectPlace place = placeOf(backed, owner, context.identity);
-    region.info.object_id_full = place.identifier;
-    region.info.object_id = static_cast<uint32_t>(place.identifier);
-    region.info.offset = place.offset;
-    region.lazilyFreedBytes = vma.lazyFree;
-    if (backed.backing == Backing::file) {
-        const uint64_t dirty = vma.sharedDirty + vma.privateDirty;
-        region.dirtyFileBytes = dirty - std::min(vma.anonymous, dirty);
-        region.path = std::move(vma.path);
-    }
-    return region;
+uint64_t takeUpTo(uint64_t& left, uint64_t most) {
+    const uint64_t taken = std::min(left, most);
+    left -= taken;
+    return taken;
 }
+
+bool isWritten(PageOwner owner) {
+    return owner == PageOwner::process || owner == PageOwner::family;
+}
+
+/// Makes the regions of one process.
+class RegionBuilder {
+public:
+    RegionBuilder(const AddressSpaceOwner& owner, PageSource& pages, const AddressSpaceContext& context,
+                  std::vector<AddressSpaceRegion>& regions)
+        : _owner(owner), _pages(pages), _context(context), _regions(regions) {}
+
+    void add(BackedVma backed, uint32_t tag) {
+        const bool isFileMapping = backed.backing == Backing::file || backed.backing == Backing::shmem;
+        if ((isFileMapping || backed.backing == Backing::anonymous) &&
+            needsOwnershipRuns(backed.vma, isFileMapping)) {
+            const std::vector<OwnershipRun> runs = ownershipRuns(
+                {.vma = backed.vma, .isFileMapping = isFileMapping, .pageSize = _context.pageSize}, _pages,
+                _family().generations);
+            if (!runs.empty()) {
+                _addRuns(backed, tag, runs);
+                return;
+            }
+        }
+        _addWhole(std::move(backed), tag);
+    }
+
+private:
+    ForkFamily& _family() {
+        if (_knownFamily == nullptr) {
+            _knownFamily = &_owner.family();
+        }
+        return *_knownFamily;
+    }
+
+    void _place(AddressSpaceRegion& region, const ObjectPlace& place) const {
+        region.info.object_id_full = place.identifier;
+        region.info.object_id = static_cast<uint32_t>(place.identifier);
+        region.info.offset = place.offset;
+    }
+
+    void _addWhole(BackedVma backed, uint32_t tag) {
+        Vma& vma = backed.vma;
+        AddressSpaceRegion region = {.start = vma.start,
+                                     .size = vma.size(),
+                                     .info = infoFor(backed, _context.pageSize),
+                                     .backing = backed.backing};
+        region.info.user_tag = tag;
+        _place(region, placeOf(backed, _owner, _context.identity));
+        region.lazilyFreedBytes = vma.lazyFree;
+        if (backed.backing == Backing::file) {
+            region.dirtyFileBytes = dirtyFileBytes(vma);
+            region.path = std::move(vma.path);
+        }
+        _regions.push_back(std::move(region));
+    }
+
+    // Lazily freed pages are the process's own as a rule (the kernel frees no others), dirty file pages the
+    // file's; how many of them lie in which run is not known, the first runs are taken.
+    void _addRuns(const BackedVma& backed, uint32_t tag, const std::vector<OwnershipRun>& runs) {
+        uint64_t lazilyFreed = backed.vma.lazyFree / _context.pageSize;
+        uint64_t dirtyFile = dirtyFileBytes(backed.vma) / _context.pageSize;
+        const size_t first = _regions.size();
+        for (const OwnershipRun& run : runs) {
+            _regions.push_back(_regionOfRun(backed, tag, run));
+        }
+        for (const PageOwner owner : {PageOwner::process, PageOwner::family, PageOwner::object}) {
+            for (size_t i = 0; i < runs.size(); ++i) {
+                if (runs[i].owner == owner) {
+                    const uint64_t reusable = isWritten(owner) ? takeUpTo(lazilyFreed, runs[i].resident) : 0;
+                    const uint64_t dirty = isWritten(owner) ? 0 : takeUpTo(dirtyFile, runs[i].resident);
+                    _count(_regions[first + i], runs[i], {.reusable = reusable, .dirtyFile = dirty});
+                }
+            }
+        }
+    }
+
+    struct PageKinds {
+        uint64_t reusable;
+        uint64_t dirtyFile;
+    };
+    void _count(AddressSpaceRegion& region, const OwnershipRun& run, PageKinds kinds) const {
+        const bool onlySwapTakes = isWritten(run.owner) || region.backing == Backing::shmem;
+        region.info.pages_resident = static_cast<uint32_t>(run.resident);
+        region.info.pages_swapped_out = static_cast<uint32_t>(run.swapped);
+        region.info.pages_reusable = static_cast<uint32_t>(kinds.reusable);
+        region.info.pages_dirtied =
+            static_cast<uint32_t>(onlySwapTakes ? run.resident - kinds.reusable : kinds.dirtyFile);
+        region.lazilyFreedBytes = kinds.reusable * _context.pageSize;
+        region.dirtyFileBytes = kinds.dirtyFile * _context.pageSize;
+        if (run.grouped && !_isUniform(region)) {
+            region.info.share_mode = SM_PRIVATE_ALIASED;
+        }
+    }
+
+    // Of one kind of pages throughout, so that nobody will look at its pages one by one: those at the
+    // addresses of a grouped run are not its own.
+    static bool _isUniform(const AddressSpaceRegion& region) {
+        const vm_region_submap_info_64& info = region.info;
+        const uint32_t most = std::max(info.pages_resident, info.pages_swapped_out);
+        const bool oneDirtiness =
+            info.pages_reusable == 0 && (info.pages_dirtied == 0 || info.pages_dirtied == most);
+        return info.pages_resident + info.pages_swapped_out == most && oneDirtiness;
+    }
+
+    AddressSpaceRegion _regionOfRun(const BackedVma& backed, uint32_t tag, const OwnershipRun& run) {
+        AddressSpaceRegion region = {.start = run.start,
+                                     .size = run.size(),
+                                     .info = infoFor(backed, _context.pageSize),
+                                     .backing = backed.backing};
+        region.info.user_tag = tag;
+        region.info.share_mode = _shareModeOfRun(run.owner);
+        region.info.pages_resident = region.info.pages_dirtied = 0;
+        region.info.pages_swapped_out = region.info.pages_reusable = 0;
+        _place(region, _placeOfRun(backed.vma, tag, run));
+        if (backed.backing == Backing::file) {
+            region.path = backed.vma.path;
+        }
+        return region;
+    }
+
+    static uint8_t _shareModeOfRun(PageOwner owner) {
+        if (owner == PageOwner::none) {
+            return SM_EMPTY;
+        }
+        return owner == PageOwner::process ? SM_PRIVATE : SM_COW;
+    }
+
+    ObjectPlace _placeOfRun(const Vma& vma, uint32_t tag, const OwnershipRun& run) {
+        switch (run.owner) {
+            case PageOwner::none:
+                return {};
+            case PageOwner::process:
+                return {_context.identity.process(_owner.pid, _owner.startTime, vma.start),
+                        run.start - vma.start};
+            case PageOwner::object:
+                return {_context.identity.file(vma.device(), vma.inode),
+                        vma.offset + (run.start - vma.start)};
+            case PageOwner::family:
+                break;
+        }
+        const uint64_t window = run.start / MWFamilyWindow * MWFamilyWindow;
+        return {
+            _context.identity.family(
+                {.family = _family().identifier, .window = window, .tag = tag, .generation = run.generation}),
+            run.start};
+    }
+
+    const AddressSpaceOwner& _owner;
+    PageSource& _pages;
+    const AddressSpaceContext& _context;
+    std::vector<AddressSpaceRegion>& _regions;
+    ForkFamily* _knownFamily = nullptr;
+};
 
 }  // namespace
 
@@ -147,7 +293,7 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
     return startsWithAny(path, {"/dev/", "/dmabuf:"}) ? Backing::special : Backing::file;
 }
 
-AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner,
+AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
                            const AddressSpaceContext& context) {
     std::vector<BackedVma> backed;
     backed.reserve(vmas.size());
@@ -157,9 +303,9 @@ AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner
     }
     const std::vector<uint32_t> tags = tagsForVmas(backed, context.names);
     _regions.reserve(backed.size());
+    RegionBuilder builder(owner, pages, context, _regions);
     for (size_t index = 0; index < backed.size(); ++index) {
-        _regions.push_back(regionFor(std::move(backed[index]), owner, context));
-        _regions.back().info.user_tag = tags[index];
+        builder.add(std::move(backed[index]), tags[index]);
     }
 }
 

@@ -1,12 +1,15 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "platform/MWHostRecords.h"
+#include "platform/linux/ForkFamily.h"
 #include "platform/linux/ObjectIdentity.h"
+#include "platform/linux/OwnershipRuns.h"
 #include "platform/linux/RegionNames.h"
 #include "platform/linux/RegionTags.h"
 #include "platform/linux/ShmemDevices.h"
@@ -17,6 +20,8 @@ struct AddressSpaceOwner {
     uint64_t startTime = 0;  ///< clock ticks since boot: with the pid it names one process of this boot
     uint64_t ipcNamespace = 0;
     int directory = -1;  ///< /proc/PID, for the mounts it sees
+    /// Its fork family; asked only where memory is shared by fork.
+    std::function<ForkFamily&()> family;
 };
 
 /// What all the processes of a run share.
@@ -41,10 +46,11 @@ struct AddressSpaceRegion {
 };
 
 /// One consistent look at a process's mappings, turned into regions: ascending, without overlap, none empty.
-/// Built from one pass over `smaps`; immutable afterwards.
+/// A mapping is one region, unless its pages have different owners: then each run of one owner is. Built from
+/// one pass over `smaps` and the pages of those mappings; immutable afterwards.
 class AddressSpace {
 public:
-    AddressSpace(std::vector<procfs::Vma> vmas, const AddressSpaceOwner& owner,
+    AddressSpace(std::vector<procfs::Vma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
                  const AddressSpaceContext& context);
 
     const std::vector<AddressSpaceRegion>& regions() const { return _regions; }

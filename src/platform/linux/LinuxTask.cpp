@@ -23,20 +23,31 @@ procfs::Descriptor openDirectory(int parent, const std::string& path) {
     return procfs::open(parent, path.c_str(), O_PATH | O_DIRECTORY);
 }
 
-// A thread of the process that has not ended; none when there is none left.
-procfs::Descriptor openLiveThread(int processDirectory) {
+std::string bootId(int procDirectory) {
+    std::string text;
+    procfs::readFile(procDirectory, "sys/kernel/random/boot_id", text);
+    return text;
+}
+
+struct LiveThread {
+    int32_t identifier = 0;
+    procfs::Descriptor directory;
+};
+
+// A thread of the process that has not ended; without a directory when there is none left.
+LiveThread openLiveThread(int processDirectory) {
     procfs::Descriptor list = procfs::open(processDirectory, "task", O_DIRECTORY);
     DIR* threads = list ? fdopendir(list.get()) : nullptr;
     if (threads == nullptr) {
         return {};
     }
     list.release();  // closed with the stream
-    procfs::Descriptor found;
+    LiveThread found;
     while (const dirent* entry = readdir(threads)) {
         procfs::Descriptor thread = openDirectory(dirfd(threads), entry->d_name);
         const auto stat = entry->d_name[0] == '.' || !thread ? std::nullopt : readStat(thread.get());
         if (stat && !stat->firstThreadEnded()) {
-            found = std::move(thread);
+            found = {stat->pid, std::move(thread)};
             break;
         }
     }
@@ -64,17 +75,27 @@ uint64_t ipcNamespace(int processDirectory) {
 
 }  // namespace
 
-std::unique_ptr<LinuxTask> LinuxTask::open(int procDirectory, int32_t pid) {
-    std::unique_ptr<LinuxTask> task(new LinuxTask);
-    task->_pid = pid;
-    task->_directory = openDirectory(procDirectory, std::to_string(pid));
+LinuxRun::LinuxRun(const std::string& procDirectory)
+    : proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
+      pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
+      identity(bootId(proc.get())),
+      frames(procfs::open(proc.get(), "kpageflags")),
+      zeroFrame(findZeroFrame(proc.get(), pageSize)) {}
+
+LinuxTask::LinuxTask(LinuxRun& run, int32_t pid)
+    : _run(run), _pid(pid), _directory(openDirectory(run.proc.get(), std::to_string(pid))), _threadId(pid) {}
+
+std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
+    std::unique_ptr<LinuxTask> task(new LinuxTask(run, pid));
     const auto stat = task->_directory ? task->_readStat() : std::nullopt;
     if (!stat) {
         return nullptr;
     }
     task->_startTime = stat->startTime;
     if (stat->firstThreadEnded() && !stat->isZombie()) {
-        task->_thread = openLiveThread(task->directory());
+        LiveThread thread = openLiveThread(task->directory());
+        task->_threadId = thread.directory ? thread.identifier : pid;
+        task->_thread = std::move(thread.directory);
     }
     return mayLook(task->_memoryDirectory()) ? std::move(task) : nullptr;
 }
@@ -105,12 +126,8 @@ bool LinuxTask::_parseSmaps(std::vector<procfs::Vma>& vmas) const {
 
 // A text that the process's end or its exec cuts short ends like any other, so the process is looked at
 // before and after: one that executes another program meanwhile is read again.
-kern_return_t LinuxTask::takeSnapshot(const AddressSpaceContext& context) {
-    if (_space) {
-        return KERN_SUCCESS;
-    }
+kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) const {
     constexpr int kAttempts = 3;
-    std::vector<procfs::Vma> vmas;
     auto before = _readStat();
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
         const bool read = _parseSmaps(vmas);
@@ -121,49 +138,66 @@ kern_return_t LinuxTask::takeSnapshot(const AddressSpaceContext& context) {
         if (!before || !after || after->isZombie()) {
             return MACH_SEND_INVALID_DEST;
         }
-        if (std::exchange(before, after)->startStack == after->startStack) {
+        startStack = after->startStack;
+        if (std::exchange(before, after)->startStack == startStack) {
             break;
         }
     }
-    if (vmas.empty()) {
-        return KERN_INVALID_ADDRESS;
+    return vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
+}
+
+ForkFamily& LinuxTask::_family() {
+    if (_forkFamily == nullptr) {
+        _forkFamily = _run.families.family(
+            forkFamilyIdentifier(_run.proc.get(), _memoryDirectory(), _threadId, _run.identity));
     }
+    return *_forkFamily;
+}
+
+kern_return_t LinuxTask::takeSnapshot() {
+    if (_space) {
+        return KERN_SUCCESS;
+    }
+    std::vector<procfs::Vma> vmas;
+    uint64_t startStack = 0;
+    const kern_return_t code = _readMappings(vmas, startStack);
+    if (code != KERN_SUCCESS) {
+        return code;
+    }
+    _pages.emplace(_memoryDirectory(), PageFacts{_run.frames, _run.zeroFrame, _run.pageSize});
+    const ProcessIdentity owner = _run.sharedSpaces.ownerOf({{_pid, _startTime}, _threadId, startStack});
     _space.emplace(std::move(vmas),
-                   AddressSpaceOwner{_pid, _startTime, ipcNamespace(directory()), directory()}, context);
+                   AddressSpaceOwner{.pid = owner.pid,
+                                     .startTime = owner.startTime,
+                                     .ipcNamespace = ipcNamespace(_memoryDirectory()),
+                                     .directory = _memoryDirectory(),
+                                     .family = [this]() -> ForkFamily& { return _family(); }},
+                   *_pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
     return KERN_SUCCESS;
 }
 
 void LinuxTask::dropSnapshot() {
     _space.reset();
-    _pagemap.reset();
+    _pages.reset();
     _entries = {};
 }
 
-bool LinuxTask::_readPagemap(uint64_t firstPage, std::span<PagemapEntry> entries) {
-    if (!_pagemap) {
-        _pagemap = procfs::open(_memoryDirectory(), "pagemap");
-    }
-    const auto bytes = std::as_writable_bytes(entries);
-    const auto offset = static_cast<off_t>(firstPage * sizeof(PagemapEntry));
-    return ::pread(_pagemap.get(), bytes.data(), bytes.size(), offset) ==
-           static_cast<ptrdiff_t>(bytes.size());
-}
-
-kern_return_t LinuxTask::fillDispositions(uint64_t start, std::span<int32_t> words,
-                                          const PageFrameFlags& frames, uint64_t pageSize) {
+kern_return_t LinuxTask::fillDispositions(uint64_t start, std::span<int32_t> words) {
     std::fill(words.begin(), words.end(), 0);
-    const uint64_t end = start + words.size() * pageSize;
+    const uint64_t end = start + words.size() * _run.pageSize;
     const AddressSpaceRegion* region = _space->regionAtOrAbove(start);
     const AddressSpaceRegion* const last = _space->regions().data() + _space->regions().size();
     for (; region != nullptr && region != last && region->start < end; ++region) {
         const uint64_t from = std::max(start, region->start);
-        const uint64_t pages = (std::min(end, region->end()) - from) / pageSize;
-        _entries.resize(pages);
-        if (!_readPagemap(from / pageSize, _entries)) {
+        _entries.resize((std::min(end, region->end()) - from) / _run.pageSize);
+        if (!_pages->readPages(from, _entries)) {
             return KERN_INVALID_ARGUMENT;
         }
-        _dispositions.fill(*region, from, _entries, frames, pageSize,
-                           words.subspan((from - start) / pageSize));
+        if (region->backing == Backing::anonymous) {
+            _pages->clearZeroPages(from, _entries);
+        }
+        _dispositions.fill(*region, from, _entries, _run.frames, _run.pageSize,
+                           words.subspan((from - start) / _run.pageSize));
     }
     return KERN_SUCCESS;
 }

@@ -4,21 +4,39 @@
 #include <memory>
 #include <optional>
 #include <span>
+#include <string>
 #include <vector>
 
 #include "platform/MWHostRecords.h"
 #include "platform/linux/AddressSpace.h"
+#include "platform/linux/LivePages.h"
 #include "platform/linux/PageDispositions.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
+#include "platform/linux/SharedAddressSpaces.h"
+
+/// What all the tasks of a run share.
+struct LinuxRun {
+    explicit LinuxRun(const std::string& procDirectory);
+
+    procfs::Descriptor proc;
+    uint64_t pageSize;
+    ObjectIdentity identity;
+    ShmemDevices shmemDevices;
+    RegionNames names;
+    ForkFamilies families;
+    SharedAddressSpaces sharedSpaces;
+    PageFrameFlags frames;
+    uint64_t zeroFrame;
+};
 
 /// What a task handle stands for: one process, held by its open directory, and during a walk the snapshot of
 /// its address space. Used by one thread at a time.
 class LinuxTask {
 public:
     /// None when there is no such process or the caller may not look at its memory. A process that has ended
-    /// but is still there can be opened: its address space is then gone.
-    static std::unique_ptr<LinuxTask> open(int procDirectory, int32_t pid);
+    /// but is still there can be opened: its address space is then gone. `run` outlives the task.
+    static std::unique_ptr<LinuxTask> open(LinuxRun& run, int32_t pid);
 
     int32_t pid() const { return _pid; }
     /// /proc/PID, opened with O_PATH.
@@ -26,7 +44,7 @@ public:
 
     /// Takes a snapshot unless there is one. MACH_SEND_INVALID_DEST when the process has ended,
     /// KERN_INVALID_ADDRESS when it lives and has no memory of its own, KERN_FAILURE when the kernel refuses.
-    kern_return_t takeSnapshot(const AddressSpaceContext& context);
+    kern_return_t takeSnapshot();
     bool hasSnapshot() const { return _space.has_value(); }
     /// There must be a snapshot.
     const AddressSpace& addressSpace() const { return *_space; }
@@ -34,23 +52,26 @@ public:
 
     /// One word for each page from `start` on; pages outside of every region read as absent. There must be a
     /// snapshot. KERN_INVALID_ARGUMENT when the process has ended.
-    kern_return_t fillDispositions(uint64_t start, std::span<int32_t> words, const PageFrameFlags& frames,
-                                   uint64_t pageSize);
+    kern_return_t fillDispositions(uint64_t start, std::span<int32_t> words);
 
 private:
-    LinuxTask() = default;
+    LinuxTask(LinuxRun& run, int32_t pid);
 
     std::optional<procfs::ProcStat> _readStat() const;
     /// The directory to read memory through: a process whose first thread has ended shows nothing there.
     int _memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
     bool _parseSmaps(std::vector<procfs::Vma>& vmas) const;
-    bool _readPagemap(uint64_t firstPage, std::span<PagemapEntry> entries);
+    kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) const;
+    ForkFamily& _family();
 
-    int32_t _pid = 0;
+    LinuxRun& _run;
+    int32_t _pid;
     uint64_t _startTime = 0;
     procfs::Descriptor _directory;
-    procfs::Descriptor _thread;  ///< task/TID of a thread that lives, when the first one does not
-    procfs::Descriptor _pagemap;
+    int32_t _threadId;                        ///< a thread that lives
+    procfs::Descriptor _thread;               ///< its task/TID, when it is not the first one
+    std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live
+    std::optional<LivePages> _pages;
     std::optional<AddressSpace> _space;
     PageDispositions _dispositions;
     std::vector<PagemapEntry> _entries;

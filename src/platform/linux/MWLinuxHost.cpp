@@ -18,12 +18,6 @@
 
 namespace {
 
-std::string bootId(int procDirectory) {
-    std::string text;
-    procfs::readFile(procDirectory, "sys/kernel/random/boot_id", text);
-    return text;
-}
-
 // With all the processes of a machine as targets each holds a directory open for the length of a run.
 void raiseDescriptorLimit() {
     rlimit limit = {};
@@ -42,11 +36,7 @@ uint64_t readClock(clockid_t clock) {
 
 }  // namespace
 
-MWLinuxHost::MWLinuxHost(const std::string& procDirectory)
-    : _proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
-      _pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
-      _identity(bootId(_proc.get())),
-      _frames(procfs::open(_proc.get(), "kpageflags")) {
+MWLinuxHost::MWLinuxHost(const std::string& procDirectory) : _run(procDirectory) {
     raiseDescriptorLimit();
 }
 
@@ -59,7 +49,7 @@ LinuxTask* MWLinuxHost::_task(task_t task) {
 }
 
 kern_return_t MWLinuxHost::task_read_for_pid(int32_t pid, task_t& task) {
-    std::unique_ptr<LinuxTask> opened = LinuxTask::open(_proc.get(), pid);
+    std::unique_ptr<LinuxTask> opened = LinuxTask::open(_run, pid);
     if (opened == nullptr) {
         return KERN_FAILURE;
     }
@@ -92,7 +82,7 @@ const AddressSpaceRegion* MWLinuxHost::_regionAtOrAbove(task_t task, uint64_t ad
         code = KERN_INVALID_ARGUMENT;
         return nullptr;
     }
-    code = record->takeSnapshot({_identity, _shmemDevices, _names, _pageSize});
+    code = record->takeSnapshot();
     if (code != KERN_SUCCESS) {
         return nullptr;
     }
@@ -144,12 +134,12 @@ kern_return_t MWLinuxHost::mach_vm_page_range_query(task_t task, uint64_t start,
     if (record == nullptr) {
         return KERN_INVALID_ARGUMENT;
     }
-    const kern_return_t code = record->takeSnapshot({_identity, _shmemDevices, _names, _pageSize});
+    const kern_return_t code = record->takeSnapshot();
     if (code != KERN_SUCCESS) {
         return code;
     }
-    count = std::min<uint64_t>(length / _pageSize, dispositions.size());
-    return record->fillDispositions(start, dispositions.first(count), _frames, _pageSize);
+    count = std::min<uint64_t>(length / _run.pageSize, dispositions.size());
+    return record->fillDispositions(start, dispositions.first(count));
 }
 
 // Two records of one pid live at once only while sampling replaces one by the other; the newer one is being
@@ -178,7 +168,7 @@ int MWLinuxHost::proc_regionfilename(int32_t pid, uint64_t address, std::span<ch
 }
 
 std::optional<std::string> MWLinuxHost::describeRegionTypeForTag(uint32_t tag) {
-    return _names.nameForTag(tag);
+    return _run.names.nameForTag(tag);
 }
 
 // Images are not listed: file mappings go by their paths.

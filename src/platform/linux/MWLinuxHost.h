@@ -11,14 +11,9 @@
 #include <vector>
 
 #include "platform/MWHostInterface.h"
-#include "platform/linux/AddressSpace.h"
 #include "platform/linux/LinuxTask.h"
-#include "platform/linux/ObjectIdentity.h"
-#include "platform/linux/PageDispositions.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
-#include "platform/linux/RegionNames.h"
-#include "platform/linux/ShmemDevices.h"
 
 /// The live answer: Linux processes, measured through procfs (5.10 and newer).
 ///
@@ -68,7 +63,7 @@ public:
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;
-    uint64_t vm_kernel_page_size() override { return _pageSize; }
+    uint64_t vm_kernel_page_size() override { return _run.pageSize; }
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(std::string_view label, kern_return_t code) override;
 
@@ -95,12 +90,7 @@ private:
     bool _readProcessFile(int32_t pid, const char* name, std::string& text);
     std::optional<procfs::ProcStat> _statOfPid(int32_t pid);
 
-    procfs::Descriptor _proc;
-    uint64_t _pageSize;
-    ObjectIdentity _identity;
-    ShmemDevices _shmemDevices;
-    RegionNames _names;
-    PageFrameFlags _frames;
+    LinuxRun _run;
     std::atomic<int32_t> _selfRegionMemweight = 0;
 
     std::mutex _tasksMutex;  ///< guards the table; a task itself is one thread's at a time

@@ -74,7 +74,7 @@ int MWLinuxHost::_processDirectory(int32_t pid, procfs::Descriptor& opened) {
     if (const LinuxTask* task = _taskOfPid(pid)) {
         return task->directory();
     }
-    opened = procfs::open(_proc.get(), std::to_string(pid).c_str(), O_PATH | O_DIRECTORY);
+    opened = procfs::open(_run.proc.get(), std::to_string(pid).c_str(), O_PATH | O_DIRECTORY);
     return opened.get();
 }
 
@@ -94,7 +94,7 @@ std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
 }
 
 int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
-    const std::vector<int32_t> entries = numericEntries(_proc.get());
+    const std::vector<int32_t> entries = numericEntries(_run.proc.get());
     if (entries.empty()) {
         return -1;
     }

@@ -7,7 +7,7 @@
 static_assert(crypto_shorthash_KEYBYTES == 16 && crypto_shorthash_BYTES == 8);
 
 namespace {
-enum Kind : uint64_t { kFile = 1, kSysV = 2, kProcess = 3 };
+enum Kind : uint64_t { kFile = 1, kSysV = 2, kProcess = 3, kFamily = 4 };
 }  // namespace
 
 // "xxxxxxxx-xxxx-...": the hexadecimal digits are the key.
@@ -34,11 +34,21 @@ uint64_t ObjectIdentity::process(int32_t pid, uint64_t startTime, uint64_t addre
     return _hash({kProcess, static_cast<uint64_t>(pid), startTime, address});
 }
 
+uint64_t ObjectIdentity::family(const FamilyMemory& memory) const {
+    const uint64_t detail = (uint64_t{memory.tag} << 32U) | memory.generation;
+    return _hash({kFamily, memory.family, memory.window, detail});
+}
+
 uint64_t ObjectIdentity::_hash(const std::array<uint64_t, 4>& what) const {
-    std::array<unsigned char, sizeof(what)> bytes = {};
-    std::memcpy(bytes.data(), what.data(), bytes.size());
+    std::array<char, sizeof(what)> raw = {};
+    std::memcpy(raw.data(), what.data(), raw.size());
+    return bytes({raw.data(), raw.size()});
+}
+
+uint64_t ObjectIdentity::bytes(std::string_view bytes) const {
     uint64_t hash = 0;
-    crypto_shorthash(reinterpret_cast<unsigned char*>(&hash), bytes.data(), bytes.size(), _key.data());
+    crypto_shorthash(reinterpret_cast<unsigned char*>(&hash),
+                     reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(), _key.data());
     hash |= uint64_t{1} << 63U;
     return hash == UINT64_MAX ? hash - 1 : hash;
 }

@@ -19,6 +19,16 @@ public:
     uint64_t sysV(uint64_t device, uint64_t inode, uint64_t ipcNamespace) const;
     /// Memory that only this process maps.
     uint64_t process(int32_t pid, uint64_t startTime, uint64_t address) const;
+    /// Memory shared copy-on-write by the processes of a fork family, in one window of their addresses.
+    struct FamilyMemory {
+        uint64_t family;
+        uint64_t window;
+        uint32_t tag;
+        uint32_t generation;
+    };
+    uint64_t family(const FamilyMemory& memory) const;
+    /// Any bytes; cannot be undone.
+    uint64_t bytes(std::string_view bytes) const;
 
 private:
     uint64_t _hash(const std::array<uint64_t, 4>& what) const;

@@ -1,7 +1,5 @@
 #include "platform/linux/PageDispositions.h"
 
-#include <unistd.h>
-
 #include <algorithm>
 
 namespace {
@@ -14,12 +12,6 @@ bool takePage(uint64_t& bytesLeft, uint64_t pageSize) {
 }
 
 }  // namespace
-
-uint64_t PageFrameFlags::flagsOfFrame(uint64_t frame) const {
-    uint64_t flags = 0;
-    const auto offset = static_cast<off_t>(frame * sizeof(flags));
-    return ::pread(_file.get(), &flags, sizeof(flags), offset) == sizeof(flags) ? flags : 0;
-}
 
 void PageDispositions::fill(const AddressSpaceRegion& region, uint64_t address,
                             std::span<const PagemapEntry> entries, const PageFrameFlags& frames,

@@ -4,36 +4,8 @@
 #include <span>
 
 #include "platform/linux/AddressSpace.h"
-#include "platform/linux/Procfs.h"
-
-/// A word of `pagemap`. The frame number reads as 0 without CAP_SYS_ADMIN; the other bits need no privilege.
-struct PagemapEntry {
-    uint64_t word = 0;
-
-    bool present() const { return (word >> 63U) != 0; }
-    bool swapped() const { return ((word >> 62U) & 1U) != 0; }
-    /// A page of a file, or shmem.
-    bool fileOrShared() const { return ((word >> 61U) & 1U) != 0; }
-    uint64_t frame() const { return present() ? word & ((uint64_t{1} << 55U) - 1) : 0; }
-};
-
-/// `kpageflags`, the kernel's flags of each page frame: one file for the system, readable by root alone.
-class PageFrameFlags {
-public:
-    explicit PageFrameFlags(procfs::Descriptor file) : _file(std::move(file)) {}
-
-    bool readable() const { return static_cast<bool>(_file); }
-    /// 0 when the frame is not known. Costs one read of 8 bytes.
-    uint64_t flagsOfFrame(uint64_t frame) const;
-
-    static constexpr uint64_t kDirty = uint64_t{1} << 4U;
-    static constexpr uint64_t kAnonymous = uint64_t{1} << 12U;
-    static constexpr uint64_t kSwapBacked = uint64_t{1} << 14U;
-    static constexpr uint64_t kZeroPage = uint64_t{1} << 24U;
-
-private:
-    procfs::Descriptor _file;
-};
+#include "platform/linux/PageFrameFlags.h"
+#include "platform/linux/PagemapEntry.h"
 
 /// Turns the pages of one region, asked for in ascending order, into disposition words.
 ///

@@ -15,11 +15,13 @@ struct Field {
 };
 
 // In the order in which the kernel writes them.
-constexpr std::array<Field, 10> kFields = {{{"Rss", &Vma::rss},
+constexpr std::array<Field, 12> kFields = {{{"Rss", &Vma::rss},
                                             {"Pss", &Vma::pss},
+                                            {"Shared_Clean", &Vma::sharedClean},
                                             {"Shared_Dirty", &Vma::sharedDirty},
                                             {"Private_Dirty", &Vma::privateDirty},
                                             {"Anonymous", &Vma::anonymous},
+                                            {"KSM", &Vma::ksm},
                                             {"LazyFree", &Vma::lazyFree},
                                             {"Shared_Hugetlb", &Vma::sharedHugetlb},
                                             {"Private_Hugetlb", &Vma::privateHugetlb},

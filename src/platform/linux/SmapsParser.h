@@ -41,9 +41,11 @@ struct Vma {
 
     uint64_t rss = 0;  ///< without hugetlb pages
     uint64_t pss = 0;
+    uint64_t sharedClean = 0;
     uint64_t sharedDirty = 0;
     uint64_t privateDirty = 0;
     uint64_t anonymous = 0;
+    uint64_t ksm = 0;  ///< merged with equal pages of any process
     uint64_t lazyFree = 0;
     uint64_t sharedHugetlb = 0;
     uint64_t privateHugetlb = 0;

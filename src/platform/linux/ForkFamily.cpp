@@ -1,0 +1,112 @@
+#include "platform/linux/ForkFamily.h"
+
+#include <sys/personality.h>
+#include <sys/uio.h>
+
+#include <elf.h>
+#include <array>
+#include <cstring>
+#include <string>
+
+#include "platform/linux/ProcText.h"
+#include "platform/linux/Procfs.h"
+
+namespace {
+
+template <class Word>
+std::optional<uint64_t> findAuxiliaryValue(std::string_view auxv, Word type) {
+    std::array<Word, 2> entry = {};
+    for (; auxv.size() >= sizeof(entry); auxv.remove_prefix(sizeof(entry))) {
+        std::memcpy(entry.data(), auxv.data(), sizeof(entry));
+        if (entry[0] == type) {
+            return entry[1];
+        }
+    }
+    return std::nullopt;
+}
+
+using RandomBytes = std::array<char, 16>;
+
+std::optional<RandomBytes> readRandomBytes(int32_t pid, std::string_view auxv) {
+    const std::optional<uint64_t> address = randomBytesAddress(auxv);
+    if (!address) {
+        return std::nullopt;
+    }
+    RandomBytes bytes = {};
+    const iovec local = {bytes.data(), bytes.size()};
+    const iovec remote = {reinterpret_cast<void*>(*address), bytes.size()};
+    const bool read = process_vm_readv(pid, &local, 1, &remote, 1, 0) == static_cast<ssize_t>(bytes.size());
+    return read ? std::optional(bytes) : std::nullopt;
+}
+
+bool hasRandomAddresses(int procDirectory, int processDirectory) {
+    std::string text;
+    if (procfs::readFile(procDirectory, "sys/kernel/randomize_va_space", text) && text.starts_with('0')) {
+        return false;
+    }
+    uint64_t personality = ADDR_NO_RANDOMIZE;
+    if (procfs::readFile(processDirectory, "personality", text)) {
+        constexpr int kHex = 16;
+        std::string_view digits = text;
+        procfs::takeNumber(digits, personality, kHex);
+    }
+    return (personality & ADDR_NO_RANDOMIZE) == 0;
+}
+
+// The oldest process of the chain of parents, beginning with `pid`, that runs the same executable.
+uint64_t oldestOfChain(int procDirectory, int32_t pid, const ObjectIdentity& identity) {
+    std::string executable;
+    std::string parentExecutable;
+    procfs::ProcStat oldest;
+    procfs::readLink(procDirectory, (std::to_string(pid) + "/exe").c_str(), executable);
+    while (pid != 0) {
+        std::string text;
+        const std::string directory = std::to_string(pid);
+        procfs::readFile(procDirectory, (directory + "/stat").c_str(), text);
+        const auto stat = procfs::parseStat(text);
+        procfs::readLink(procDirectory, (directory + "/exe").c_str(), parentExecutable);
+        if (!stat || parentExecutable != executable) {
+            break;
+        }
+        oldest = *stat;
+        pid = stat->ppid;
+    }
+    return identity.process(oldest.pid, oldest.startTime, 0);
+}
+
+}  // namespace
+
+std::optional<uint64_t> randomBytesAddress(std::string_view auxv) {
+    const std::optional<bool> is64bit = procfs::auxvIs64bit(auxv);
+    if (!is64bit) {
+        return std::nullopt;
+    }
+    return *is64bit ? findAuxiliaryValue<uint64_t>(auxv, AT_RANDOM)
+                    : findAuxiliaryValue<uint32_t>(auxv, AT_RANDOM);
+}
+
+uint64_t forkFamilyIdentifier(int procDirectory, int processDirectory, int32_t pid,
+                              const ObjectIdentity& identity) {
+    std::string auxv;
+    procfs::readFile(processDirectory, "auxv", auxv);
+    if (const auto bytes = readRandomBytes(pid, auxv)) {
+        return identity.bytes({bytes->data(), bytes->size()});
+    }
+    if (!auxv.empty() && hasRandomAddresses(procDirectory, processDirectory)) {
+        return identity.bytes(auxv);
+    }
+    return oldestOfChain(procDirectory, pid, identity);
+}
+
+std::shared_ptr<ForkFamily> ForkFamilies::family(uint64_t identifier) {
+    const std::lock_guard lock(_mutex);
+    std::erase_if(_families, [](const auto& entry) { return entry.second.expired(); });
+    std::weak_ptr<ForkFamily>& known = _families[identifier];
+    std::shared_ptr<ForkFamily> family = known.lock();
+    if (family == nullptr) {
+        family = std::make_shared<ForkFamily>();
+        family->identifier = identifier;
+        known = family;
+    }
+    return family;
+}
