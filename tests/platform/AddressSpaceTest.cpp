@@ -2,42 +2,15 @@
 
 #include <gtest/gtest.h>
 
-#include <map>
-#include <set>
 #include <string>
 #include <vector>
 
 #include "platform/MWRegionTags.h"
+#include "support/WrittenPages.h"
 
 namespace {
 
 constexpr uint64_t kPage = 4096;
-
-/// Pages written down by a test, by address; all others are absent.
-class WrittenPages : public PageSource {
-public:
-    std::map<uint64_t, PagemapEntry> pages;
-    std::set<uint64_t> zeroPages;
-
-    bool readPages(uint64_t address, std::span<PagemapEntry> entries) override {
-        for (PagemapEntry& entry : entries) {
-            const auto found = pages.find(address);
-            entry = found == pages.end() ? PagemapEntry{} : found->second;
-            address += kPage;
-        }
-        return true;
-    }
-    void clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) override {
-        for (PagemapEntry& entry : entries) {
-            entry.word = zeroPages.contains(address) ? 0 : entry.word;
-            address += kPage;
-        }
-    }
-    uint64_t nextPopulated(uint64_t address, uint64_t end) override {
-        const auto found = pages.lower_bound(address);
-        return found == pages.end() ? end : std::min(end, found->first);
-    }
-};
 
 /// Builds regions from the text of smaps, for a process on whose mounts nothing is tmpfs.
 class AddressSpaceTest : public testing::Test {
@@ -78,7 +51,8 @@ struct KindRow {
 
 TEST_F(AddressSpaceTest, EachKindOfMapping) {
     const std::string counts =
-        "\nRss: 40 kB\nPrivate_Dirty: 12 kB\nAnonymous: 16 kB\nLazyFree: 4 kB\nSwap: 8 kB\nSwapPss: 8 kB\nVmFlags: rd\n";
+        "\nRss: 40 kB\nPrivate_Dirty: 12 kB\nAnonymous: 16 kB\nLazyFree: 4 kB\nSwap: 8 kB\nSwapPss: 8 "
+        "kB\nVmFlags: rd\n";
     for (const KindRow& row : {
              KindRow{"rw-p 00000000 00:00 0", MWTagNone, SM_PRIVATE, 0, 3},
              KindRow{"rw-p 00000000 00:00 0 [heap]", MWTagBrkHeap, SM_PRIVATE, 0, 3},

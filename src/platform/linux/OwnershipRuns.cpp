@@ -68,8 +68,8 @@ public:
 
 private:
     static uint64_t runsForAWindow(const procfs::Vma& vma) {
-        constexpr uint64_t kFewest = 4;
-        return std::max(kFewest, kMostRuns / (vma.size() / MWFamilyWindow + 1));
+        const uint64_t windows = (vma.end - 1) / MWFamilyWindow - vma.start / MWFamilyWindow + 1;
+        return std::max(uint64_t{2}, kMostRuns / windows);
     }
 
     Ownership _ownership(PagemapEntry entry) const {
@@ -184,7 +184,8 @@ private:
     // At least one run has an owner; those without one have no pages and get none.
     void _reconcile(uint64_t OwnershipRun::*count, uint64_t wanted) {
         const auto isLess = [=](const OwnershipRun& a, const OwnershipRun& b) {
-            return std::pair(a.owner != PageOwner::none, a.*count) < std::pair(b.owner != PageOwner::none, b.*count);
+            return std::pair(a.owner != PageOwner::none, a.*count) <
+                   std::pair(b.owner != PageOwner::none, b.*count);
         };
         for (uint64_t found = _total(count); found != wanted; found = _total(count)) {
             OwnershipRun& largest = *std::max_element(_runs.begin(), _runs.end(), isLess);

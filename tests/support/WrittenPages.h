@@ -1,0 +1,35 @@
+#pragma once
+
+#include <algorithm>
+#include <cstdint>
+#include <map>
+#include <set>
+#include <span>
+
+#include "platform/linux/OwnershipRuns.h"
+
+/// Pages written down by a test, by address; all others are absent.
+class WrittenPages : public PageSource {
+public:
+    std::map<uint64_t, PagemapEntry> pages;
+    std::set<uint64_t> zeroPages;
+
+    bool readPages(uint64_t address, std::span<PagemapEntry> entries) override {
+        for (PagemapEntry& entry : entries) {
+            const auto found = pages.find(address);
+            entry = found == pages.end() ? PagemapEntry{} : found->second;
+            address += 4096;
+        }
+        return true;
+    }
+    void clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) override {
+        for (PagemapEntry& entry : entries) {
+            entry.word = zeroPages.contains(address) ? 0 : entry.word;
+            address += 4096;
+        }
+    }
+    uint64_t nextPopulated(uint64_t address, uint64_t end) override {
+        const auto found = pages.lower_bound(address);
+        return found == pages.end() ? end : std::min(end, found->first);
+    }
+};
