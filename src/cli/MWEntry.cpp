@@ -1,0 +1,156 @@
+#include "cli/MWEntry.h"
+
+#include <fmt/printf.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <memory>
+#include <vector>
+
+#include "analysis/MWMemweight.h"
+#include "cli/MWUsage.h"
+#include "platform/MWHostInterface.h"
+
+namespace {
+
+constexpr int kSuccess = 0;
+constexpr int kFailure = 1;
+
+using Formatters = std::vector<std::unique_ptr<MWOutputFormatter>>;
+
+// Messages are written with the C library's functions or fmt::fprintf, never fmt::print: a closed standard
+// error must not end the run with an exception.
+
+void printDescription(const std::optional<MWError>& error) {
+    if (error && error->description) {
+        fmt::fprintf(stderr, "%s\n", *error->description);
+    }
+}
+
+int rejectArguments(const MWError& error) {
+    printDescription(error);
+    MWPrintUsage();
+    return error.domain == MWMemweightError && error.code == MWErrorHelp ? kSuccess : kFailure;
+}
+
+std::vector<const char*> optionsNotBuilt(const MWMemweightArgs& args) {
+    std::vector<const char*> options;
+    if (args.JSONOutputFile()) {
+        options.push_back("--json");
+    }
+    if (args.statpackOutputFile()) {
+        options.push_back("--statpack");
+    }
+    if (args.spanlistLikeOutput()) {
+        options.push_back("-v");
+    }
+    if (args.sampleInterval() != 0) {
+        options.push_back("--sample");
+    }
+    return options;
+}
+
+bool needsRoot(const MWMemweightArgs& args) {
+    return args.targetAll() || args.searchForUnmapped();
+}
+
+Formatters createFormatters(const MWMemweightArgs& args) {
+    Formatters formatters;
+    formatters.push_back(std::make_unique<MWOutputFormatterText>(MWTextStyle{
+        .summaryFormat = args.summaryFormat(), .options = args.textOptions(), .sort = args.textSort()}));
+    return formatters;
+}
+
+/// None when there is nothing to measure; the user has then been told why.
+std::optional<MWTargetMap> resolveTargets(MWMemweightArgs& args) {
+    MWTargetResolution resolution = args.targetProcesses();
+    if (!resolution.targets) {
+        printDescription(resolution.error);
+        MWPrintUsage();
+        return std::nullopt;
+    }
+    if (resolution.targets->empty()) {
+        std::fputs(
+            "Unable to find any processes matching the supplied process names or pids (try as root?)\n",
+            stderr);
+        return std::nullopt;
+    }
+    printDescription(resolution.error);
+    return std::move(resolution.targets);
+}
+
+/// An output file of a failed run would pass for the result of a good one.
+int removeOutputFiles(const MWMemweightArgs& args) {
+    for (const auto& path : {args.JSONOutputFile(), args.statpackOutputFile()}) {
+        if (path) {
+            MWHostInterface::current().unlinkRegularFile(*path);
+        }
+    }
+    return kFailure;
+}
+
+/// Where a terminal shows the report, an interrupt ends the run as in any other program. Elsewhere it ends
+/// the gathering only, so that a report in a file is complete.
+void gatherAndAnalyze(MWMemweight& memweight) {
+    std::unique_ptr<MWInterruptSource> interrupt;
+    if (!MWHostInterface::current().isatty(STDOUT_FILENO)) {
+        interrupt = MWMemweight::installCancelHandler([&memweight] {
+            memweight.cancel();
+            std::fputs("Exiting early due to SIGINT\n", stderr);
+        });
+    }
+    memweight.gatherData();
+    memweight.analyzeData();
+}
+
+void measure(const MWMemweightArgs& args, const MWTargetMap& targets, const Formatters& formatters) {
+    std::vector<std::shared_ptr<MWProcess>> processes;
+    processes.reserve(targets.size());
+    for (const auto& [pid, process] : targets) {
+        processes.push_back(process);
+    }
+    MWMemweight memweight(std::move(processes));
+    gatherAndAnalyze(memweight);
+    for (const auto& formatter : formatters) {
+        memweight.addOutputFormatter(*formatter);
+    }
+    memweight.printOutputVerbose({.verbose = args.spanlistLikeOutput(), .summarize = args.summarize()});
+}
+
+}  // namespace
+
+int MWMemweightMain(int argc, char* const argv[]) {
+    auto args = MWMemweightArgs::initWithArgc(argc, argv);
+    if (!args) {
+        return rejectArguments(args.error());
+    }
+    if (const auto options = optionsNotBuilt(*args); !options.empty()) {
+        for (const char* option : options) {
+            fmt::fprintf(stderr, "memweight: %s is not built yet\n", option);
+        }
+        return kFailure;
+    }
+    return MWRunMemweight(*args);
+}
+
+int MWRunMemweight(MWMemweightArgs& args) {
+    // Before the formatters are made: a document records the mode when it is opened.
+    if (args.shouldGetPhysMemweightBreakdown()) {
+        MWMemweight::setBreakDownPhysMemweight(true);
+    }
+    if (needsRoot(args) && MWHostInterface::current().geteuid() != 0) {
+        std::fputs("Must run as root.\n", stderr);
+        return kFailure;
+    }
+    // Before the targets are resolved: an output that cannot be written fails before any process is read.
+    const Formatters formatters = createFormatters(args);
+    const auto targets = resolveTargets(args);
+    if (!targets) {
+        return removeOutputFiles(args);
+    }
+    measure(args, *targets, formatters);
+    for (const auto& formatter : formatters) {
+        formatter->close();
+    }
+    return kSuccess;
+}

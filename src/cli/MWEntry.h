@@ -1,0 +1,11 @@
+#pragma once
+
+#include "cli/MWMemweightArgs.h"
+
+/// The program: parses the command line, measures, reports. Returns the exit status, 0 or 1. The host must be
+/// installed. The report goes to standard output, every message to standard error.
+int MWMemweightMain(int argc, char* const argv[]);
+
+/// The run of a command line that was parsed: one measurement of the processes that it names, or, when there
+/// is none, a message and no output file left behind. Returns the exit status.
+int MWRunMemweight(MWMemweightArgs& args);
