@@ -7,6 +7,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/MWHostRecords.h"
 
@@ -21,6 +22,9 @@ struct MWImageSegmentDescription {
 class MWImageDescription {
 public:
     virtual ~MWImageDescription() = default;
+    /// Free of symbolic links: the file as the host finds it mapped. The program itself never looks a path of
+    /// another process up: that would cost a walk through the file system for each image of each process, and
+    /// in its own mount namespace, where the path may lead elsewhere.
     virtual std::string path() const = 0;
     virtual uint64_t baseAddress() const = 0;
     virtual void forEachSegment(const std::function<void(const MWImageSegmentDescription&)>& block) const = 0;
@@ -61,6 +65,9 @@ public:
     virtual kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size,
                                                  uint32_t& depth, vm_region_submap_info_64& info,
                                                  uint32_t& count) = 0;
+    /// What is doubtful about the regions reported since the last call, a sentence each; most hosts have
+    /// nothing to say.
+    virtual std::vector<std::string> takeTaskWarnings(task_t) { return {}; }
     virtual kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                          vm_region_basic_info_64& info, uint32_t& count) = 0;
     /// `control` is VM_PURGABLE_GET_STATE.

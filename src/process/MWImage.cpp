@@ -4,13 +4,18 @@
 
 #include "model/MWMemoryRegion.h"
 
-void MWImage::setName(std::string name) {
+const MWSharedText& MWImage::_noText() {
+    static const auto none = std::make_shared<const std::string>();
+    return none;
+}
+
+void MWImage::setName(MWSharedText name) {
     _name = std::move(name);
-    if (_name.starts_with("__TEXT") || _name.starts_with("__OBJC_RO")) {
+    if (_name->starts_with("__TEXT") || _name->starts_with("__OBJC_RO")) {
         _segment = SegmentText;
-    } else if (_name.starts_with("__LINKEDIT")) {
+    } else if (_name->starts_with("__LINKEDIT")) {
         _segment = SegmentLinkedit;
-    } else if (_name.starts_with("__")) {
+    } else if (_name->starts_with("__")) {
         _segment = SegmentData;
     }
 }

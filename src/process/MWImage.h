@@ -4,7 +4,10 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <utility>
 #include <vector>
+
+#include "process/MWInterningTables.h"
 
 /// One segment of a loaded image: [start, end) in bytes, its name and the path of the image.
 class MWImage {
@@ -16,18 +19,21 @@ public:
     uint64_t size() const { return _size; }
     void setSize(uint64_t size) { _size = size; }
     uint64_t end() const { return _start + _size; }
-    const std::string& name() const { return _name; }
-    /// Also sets the kind; a name that does not begin with two underscores leaves the kind as it is.
-    void setName(std::string name);
-    const std::string& ownerPath() const { return _ownerPath; }
-    void setOwnerPath(std::string ownerPath) { _ownerPath = std::move(ownerPath); }
+    const std::string& name() const { return *_name; }
+    /// Also sets the kind; a name that does not begin with two underscores leaves the kind as it is. The text
+    /// (never null) is shared with its other holders.
+    void setName(MWSharedText name);
+    const std::string& ownerPath() const { return *_ownerPath; }
+    void setOwnerPath(MWSharedText ownerPath) { _ownerPath = std::move(ownerPath); }
 
 private:
+    static const MWSharedText& _noText();
+
     uint8_t _segment = 0;
     uint64_t _start = 0;
     uint64_t _size = 0;
-    std::string _name;
-    std::string _ownerPath;
+    MWSharedText _name = _noText();
+    MWSharedText _ownerPath = _noText();
 };
 
 /// Ascending by start.

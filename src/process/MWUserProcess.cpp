@@ -112,11 +112,6 @@ void MWUserProcess::gatherData() {
     _images.reset();
 }
 
-bool MWUserProcess::_addRegionsToArray(MWMemoryRegionList&, const MWSharedRegionMapping&) {
-    _addError(fmt::format("{}: splitting the rtld shared cache by image is not built yet", displayString()));
-    return false;
-}
-
 void MWUserProcess::_processMachVMError(kern_return_t result, MWExpectedError expected) {
     std::string_view fate;
     if (result == expected.expectingErrorOnExit && _isAlive()) {
@@ -128,6 +123,15 @@ void MWUserProcess::_processMachVMError(kern_return_t result, MWExpectedError ex
         _addError(std::move(message));
     } else {
         _addWarning(std::move(message));
+    }
+}
+
+void MWUserProcess::_addTaskWarnings() {
+    if (!_task) {
+        return;
+    }
+    for (const std::string& warning : MWHostInterface::current().takeTaskWarnings(*_task)) {
+        _addWarning(fmt::format("{}: {}", displayString(), warning));
     }
 }
 

@@ -14,6 +14,8 @@
 #include "process/MWImage.h"
 #include "process/MWProcess.h"
 
+class MWImageDescription;
+
 /// One region as the walk reports it.
 struct MWWalkedRegion {
     uint64_t address = 0;
@@ -104,11 +106,13 @@ protected:
 
     // Images and the rtld shared cache.
 
-    /// Fills `_images`. Nothing yet: images are not listed so far, so no region has an image's name.
-    virtual void _gatherImageData() {}
+    /// Fills `_images` from one listing of the images that are loaded now.
+    virtual void _gatherImageData();
     /// Chooses the shared cache's place by platform; false for MWPlatformUnknown.
     virtual bool _setSharedRegionFromPlatform(int platformCode);
-    /// Appends the pieces of one shared-cache mapping to `regions`; false when it could not be measured.
+    /// Cuts one shared-cache mapping into a region for each image segment and one for each stretch between
+    /// them, and appends these to `regions`; false when one could not be measured. Text and linkedit pieces
+    /// are nobody's to write and are not measured.
     virtual bool _addRegionsToArray(MWMemoryRegionList& regions, const MWSharedRegionMapping& mapping);
     bool _isInSharedCache(uint64_t address) const { return address - _sharedRegionBase < _sharedRegionSize; }
 
@@ -145,6 +149,8 @@ protected:
     virtual void _processMachVMError(kern_return_t result, MWExpectedError expected);
     /// Prints and files a warning with the text of errno.
     virtual void _addErrnoWarningWithDescription(std::string_view description);
+    /// Files what the host finds doubtful about the regions that it reported.
+    void _addTaskWarnings();
     void _printBailingOut() const;
 
     // What the steps share.
@@ -168,9 +174,15 @@ protected:
 private:
     struct MemoryGathering;
     struct SharedPageCharge;
+    struct SharedMappingSplit;
     enum class WalkStep : uint8_t { end, region, sharedMapping, notShared };
 
     int _platformCode() const;
+    MWSharedText _ownerPath(const MWImageDescription& image) const;
+
+    // The next piece of a shared-cache mapping, at the cursor; false when it could not be measured.
+    bool _addSharedCacheGap(SharedMappingSplit& split);
+    bool _addSharedCacheImagePiece(SharedMappingSplit& split);
 
     // Classification of one walked region; `gathering` is the state of the walk so far.
     bool _classifyRegion(MemoryGathering& gathering, const MWWalkedRegion& walked);

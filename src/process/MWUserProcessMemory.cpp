@@ -120,6 +120,7 @@ void MWUserProcess::_gatherMemoryData() {
                                  .hidden = hiddenFromDisplay(),
                                  .breakDown = breakDownPhysMemweight()};
     enumerateRegions([&](const MWWalkedRegion& walked) { return _classifyRegion(gathering, walked); });
+    _addTaskWarnings();
     _pendingUnusedSharedRegion.reset();
     _appendLeftoverOwnedObjects(gathering.regions);
     _settleHolder(gathering);

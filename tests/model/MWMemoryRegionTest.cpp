@@ -106,7 +106,7 @@ TEST(MWMemoryRegion, NamesTagsByTheTableThenByTheSystemThenByNumber) {
     const std::map<uint32_t, std::string> expected = {
         {0, "untagged (\"VM_ALLOCATE\")"},
         {1, "malloc heap (brk)"},
-        {98, "checkpoint"},
+        {98, "vvar (virtual clock)"},
         {100, "frame cache"},
         {101, "tag 101"},
         {102, "tag 102"},

@@ -35,7 +35,7 @@ protected:
     ObjectIdentity _identity{"0dd6b3ac-0f4b-4c3c-8b0f-5f5f1f0a6d11"};
     ShmemDevices _devices;
     RegionNames _names;
-    ForkFamily _family{.identifier = 77, .generations = {}};
+    ForkFamily _family{77};
     WrittenPages _pages;
 };
 
@@ -127,29 +127,6 @@ TEST_F(AddressSpaceTest, WrittenCopiesOfAFileBelongToTheirProcess) {
     const std::string smaps =
         "100000-200000 rw-p 00001000 fe:00 9 /usr/lib/libx.so\nRss: 8 kB\nAnonymous: 4 kB\n";
     EXPECT_NE(only(smaps, 10).info.object_id_full, only(smaps, 11).info.object_id_full);
-}
-
-TEST_F(AddressSpaceTest, NeighboursTellArenasStacksAndGuards) {
-    const AddressSpace space = build(
-        // An arena of the C library in use, with its reserve; a whole one.
-        "7f0000000000-7f0000021000 rw-p 00000000 00:00 0\nRss: 4 kB\n"
-        "7f0000021000-7f0004000000 ---p 00000000 00:00 0\n"
-        "7f0008000000-7f000c000000 rw-p 00000000 00:00 0\nRss: 4 kB\n"
-        // A thread's stack above its guard, then memory that just follows it.
-        "7f0010000000-7f0010001000 ---p 00000000 00:00 0\n"
-        "7f0010001000-7f0010801000 rw-p 00000000 00:00 0\nRss: 4 kB\nVmFlags: rd wr nh \n"
-        "7f0010801000-7f0010802000 rw-p 00000000 00:00 0\nRss: 4 kB\n"
-        // Inaccessible memory beside nothing; a page above a large reservation.
-        "7f0020000000-7f0020001000 ---p 00000000 00:00 0\n"
-        "7f0030000000-7f0040001000 ---p 00000000 00:00 0\n"
-        "7f0040001000-7f0040101000 rw-p 00000000 00:00 0\nRss: 4 kB\n");
-    std::vector<uint32_t> tags;
-    for (const auto& region : space.regions()) {
-        tags.push_back(region.info.user_tag);
-    }
-    EXPECT_EQ(tags,
-              (std::vector<uint32_t>{MWTagMallocArena, MWTagMallocReserve, MWTagMallocArena, MWTagStackGuard,
-                                     MWTagThreadStack, MWTagNone, MWTagGuard, MWTagGuard, MWTagNone}));
 }
 
 TEST_F(AddressSpaceTest, NamesThatProgramsGiveBecomeTags) {

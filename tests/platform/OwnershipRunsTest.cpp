@@ -201,6 +201,13 @@ TEST(OwnershipRuns, EachFrameOfAPageHasOneGenerationWhoeverComesFirst) {
     }
 }
 
+TEST(OwnershipRuns, HiddenFramesAreOneGenerationAndCountTheirPagesOnce) {
+    FrameGenerations generations;
+    EXPECT_EQ(describe(Mapping("SSS.").runs(generations)), "0+4 family 3/0\n");
+    EXPECT_EQ(describe(Mapping(".SSS").runs(generations)), "0+4 family 3/0\n");
+    EXPECT_EQ(generations.pages(), 4U);
+}
+
 TEST(ForkFamily, RandomBytesAreFoundInAuxv) {
     const auto entry = [](uint64_t type, uint64_t value) {
         return std::string(reinterpret_cast<const char*>(&type), 8) +
@@ -221,9 +228,9 @@ TEST(ForkFamily, AFamilyIsForgottenWithItsLastMember) {
     const FrameGenerations::Page old = {0, 77};
     const FrameGenerations::Page now = {0, 78};
     uint16_t generation = 9;
-    first->generations.assign(kBase, std::span(&old, 1), std::span(&generation, 1));
+    first->generations().assign(kBase, std::span(&old, 1), std::span(&generation, 1));
     first.reset();
-    families.family(5)->generations.assign(kBase, std::span(&now, 1), std::span(&generation, 1));
+    families.family(5)->generations().assign(kBase, std::span(&now, 1), std::span(&generation, 1));
     EXPECT_EQ(generation, 0);
 }
 

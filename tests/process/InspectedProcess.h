@@ -23,7 +23,10 @@ public:
     }
 
     std::optional<MWOwnedObjects> ownedObjects;
-    MWImageList images;
+    MWImageList listImages() {
+        _gatherImageData();
+        return *_images;
+    }
     void setPageTables(uint64_t bytes) { _ledgers[0] = bytes; }
 
     using MWUserProcess::_addErrnoWarningWithDescription;
@@ -34,5 +37,4 @@ public:
 
 protected:
     std::optional<MWOwnedObjects> _gatherOwnedVmObjects() override { return ownedObjects; }
-    void _gatherImageData() override { *_images = images; }
 };

@@ -10,7 +10,7 @@ MWImage image(uint64_t start, uint64_t end, const std::string& name = "__DATA") 
     MWImage result;
     result.setStart(start);
     result.setSize(end - start);
-    result.setName(name);
+    result.setName(std::make_shared<const std::string>(name));
     return result;
 }
 
@@ -23,7 +23,7 @@ TEST(MWImageTest, KindFollowsSegmentName) {
         EXPECT_EQ(image(0, 1, name).segment(), kind) << name;
     }
     MWImage renamed = image(0, 1, "__LINKEDIT");
-    renamed.setName("unknown");
+    renamed.setName(std::make_shared<const std::string>("unknown"));
     EXPECT_EQ(renamed.segment(), SegmentLinkedit);
 }
 

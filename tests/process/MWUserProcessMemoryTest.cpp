@@ -113,12 +113,8 @@ TEST(MWUserProcessMemoryTest, NamesRegions) {
         {.start = 0x7000000000, .size = 0x40000000},
     });
     const auto process = InspectedProcess::of(7);
-    MWImage text;
-    text.setStart(0x1F000);
-    text.setSize(0x1000);
-    text.setName("__TEXT");
-    text.setOwnerPath("/bin/tool (resolved)");
-    process->images = {text};
+    world.host.processes[7].images = {
+        {.path = "/bin/tool (resolved)", .baseAddress = 0x1F000, .segments = {{"__TEXT", 0x1F000, 0x1000}}}};
     EXPECT_EQ(linesOf(*process),
               (Lines{"__TEXT|/bin/tool (resolved) 10000: 3+4 5 2", "mapped file|/data 20000: 3+4 5 2",
                      "tag 300|- 30000: 8+4 0 2 wired", "commpage (reserved)|- fc0000000: 0+0 0 0 verbose",

@@ -171,10 +171,9 @@ TEST(MWUserProcessWalkTest, SharedCacheCountsOnlyWhereThereIsOne) {
     EXPECT_EQ(hidden->memoryRegions()->size(), 1);
     EXPECT_EQ(hidden->errors(), Lines());
     const auto shown = InspectedProcess::of(7);
-    testing::internal::CaptureStderr();
     shown->gatherData();
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), kBailingOut);
-    EXPECT_EQ(shown->errors().size(), 1) << "a cache that cannot be split is no silent gap in the figures";
+    EXPECT_EQ(shown->memoryRegions()->size(), 2);
+    EXPECT_TRUE(shown->memoryRegions()->back()->inSharedCache());
 
     testing::internal::CaptureStderr();
     EXPECT_FALSE(plain->_setSharedRegionFromPlatform(MWPlatformUnknown));

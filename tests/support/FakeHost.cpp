@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 #include "platform/MWPhysMemweightSwitch.h"
 
@@ -138,6 +139,10 @@ kern_return_t FakeHost::mach_vm_region(task_t task, uint64_t& address, uint64_t&
     info.offset = region->info.offset;
     info.user_wired_count = region->info.user_wired_count;
     return KERN_SUCCESS;
+}
+
+std::vector<std::string> FakeHost::takeTaskWarnings(task_t task) {
+    return std::exchange(processes.at(pidOfTask(task)).taskWarnings, {});
 }
 
 kern_return_t FakeHost::mach_vm_purgable_control(task_t task, uint64_t address, int32_t, int32_t& state) {

@@ -44,6 +44,7 @@ struct FakeProcess {
     uint64_t mappingFailureFrom = UINT64_MAX;
     kern_return_t mappingFailure = KERN_FAILURE;
     kern_return_t pageQueryFailure = KERN_SUCCESS;
+    std::vector<std::string> taskWarnings = {};
     bool gone = false;  ///< proc_pidinfo fails with ESRCH
     uint32_t dirtyFlags = 0;
     rusage_info_v5 usage = {};
@@ -85,6 +86,7 @@ public:
     bool hasSharedCache(task_t task) override;
     kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
                                          vm_region_submap_info_64& info, uint32_t& count) override;
+    std::vector<std::string> takeTaskWarnings(task_t task) override;
     kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                  vm_region_basic_info_64& info, uint32_t& count) override;
     kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control,

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <utility>
 
+#include "platform/MWRegionTags.h"
+
 namespace {
 
 using procfs::Vma;
@@ -66,11 +68,11 @@ bool hasInodeOfItsOwn(const Vma& vma) {
 
 ObjectPlace placeOf(const BackedVma& backed, const AddressSpaceOwner& owner, const ObjectIdentity& identity) {
     const Vma& vma = backed.vma;
-    const ObjectPlace own = {identity.process(owner.pid, owner.startTime, vma.start), 0};
-    if (backed.backing == Backing::anonymous) {
-        return isUntouched(vma) ? ObjectPlace{} : own;
+    if (isUntouched(vma)) {
+        return {};  // no pages, no object: a whole span without pages would hide those of its other sharers
     }
-    if (hasOwnPages(vma)) {
+    const ObjectPlace own = {identity.process(owner.pid, owner.startTime, vma.start), 0};
+    if (backed.backing == Backing::anonymous || hasOwnPages(vma)) {
         return own;
     }
     if (vma.path.starts_with(kSysVPath)) {
@@ -126,22 +128,42 @@ public:
                   std::vector<AddressSpaceRegion>& regions)
         : _owner(owner), _pages(pages), _context(context), _regions(regions) {}
 
-    void add(BackedVma backed, uint32_t tag) {
+    /// `image` is the one whose segment the mapping is, or null.
+    void add(BackedVma backed, uint32_t tag, const LinuxImage* image) {
         const bool isFileMapping = backed.backing == Backing::file || backed.backing == Backing::shmem;
         if ((isFileMapping || backed.backing == Backing::anonymous) &&
             needsOwnershipRuns(backed.vma, isFileMapping)) {
             const std::vector<OwnershipRun> runs = ownershipRuns(
                 {.vma = backed.vma, .isFileMapping = isFileMapping, .pageSize = _context.pageSize}, _pages,
-                _family().generations);
+                _family().generations());
             if (!runs.empty()) {
-                _addRuns(backed, tag, runs);
+                _addRuns(backed, {.tag = tag, .file = _fileOf(backed, image)}, runs);
+                _partOfFamilyMemory += _partOf(backed, runs);
                 return;
             }
         }
         _addWhole(std::move(backed), tag);
     }
 
+    uint64_t partOfFamilyMemory() const { return _partOfFamilyMemory; }
+
 private:
+    /// What tells the memory of one window apart: each use of it has a name of its own, so it is an object of
+    /// its own. A file's memory is named for the file and not by the tag, which can differ within it.
+    struct Use {
+        uint32_t tag;
+        uint64_t file;
+    };
+
+    // The file's identity; 0 for memory of no file.
+    uint64_t _fileOf(const BackedVma& backed, const LinuxImage* image) const {
+        if (image != nullptr) {
+            return _context.identity.file(image->device, image->inode);
+        }
+        const Vma& vma = backed.vma;
+        return backed.backing == Backing::anonymous ? 0 : _context.identity.file(vma.device(), vma.inode);
+    }
+
     ForkFamily& _family() {
         if (_knownFamily == nullptr) {
             _knownFamily = &_owner.family();
@@ -173,12 +195,12 @@ private:
 
     // Lazily freed pages are the process's own as a rule (the kernel frees no others), dirty file pages the
     // file's; how many of them lie in which run is not known, the first runs are taken.
-    void _addRuns(const BackedVma& backed, uint32_t tag, const std::vector<OwnershipRun>& runs) {
+    void _addRuns(const BackedVma& backed, const Use& use, const std::vector<OwnershipRun>& runs) {
         uint64_t lazilyFreed = backed.vma.lazyFree / _context.pageSize;
         uint64_t dirtyFile = dirtyFileBytes(backed.vma) / _context.pageSize;
         const size_t first = _regions.size();
         for (const OwnershipRun& run : runs) {
-            _regions.push_back(_regionOfRun(backed, tag, run));
+            _regions.push_back(_regionOfRun(backed, use, run));
         }
         for (const PageOwner owner : {PageOwner::process, PageOwner::family, PageOwner::object}) {
             for (size_t i = 0; i < runs.size(); ++i) {
@@ -189,6 +211,20 @@ private:
                 }
             }
         }
+    }
+
+    // What the mapping's proportional counts hold beside the process's own pages. The counts of a file's
+    // mapping hold the file's pages too, so they tell nothing.
+    uint64_t _partOf(const BackedVma& backed, const std::vector<OwnershipRun>& runs) const {
+        if (backed.backing != Backing::anonymous) {
+            return 0;
+        }
+        uint64_t own = 0;
+        for (const OwnershipRun& run : runs) {
+            own += run.owner == PageOwner::process ? (run.resident + run.swapped) * _context.pageSize : 0;
+        }
+        const uint64_t proportional = backed.vma.pss + backed.vma.swapPss;
+        return proportional - std::min(own, proportional);
     }
 
     struct PageKinds {
@@ -219,16 +255,16 @@ private:
         return info.pages_resident + info.pages_swapped_out == most && oneDirtiness;
     }
 
-    AddressSpaceRegion _regionOfRun(const BackedVma& backed, uint32_t tag, const OwnershipRun& run) {
+    AddressSpaceRegion _regionOfRun(const BackedVma& backed, const Use& use, const OwnershipRun& run) {
         AddressSpaceRegion region = {.start = run.start,
                                      .size = run.size(),
                                      .info = infoFor(backed, _context.pageSize),
                                      .backing = backed.backing};
-        region.info.user_tag = tag;
+        region.info.user_tag = use.tag;
         region.info.share_mode = _shareModeOfRun(run.owner);
         region.info.pages_resident = region.info.pages_dirtied = 0;
         region.info.pages_swapped_out = region.info.pages_reusable = 0;
-        _place(region, _placeOfRun(backed.vma, tag, run));
+        _place(region, _placeOfRun(backed.vma, use, run));
         if (backed.backing == Backing::file) {
             region.path = backed.vma.path;
         }
@@ -242,7 +278,7 @@ private:
         return owner == PageOwner::process ? SM_PRIVATE : SM_COW;
     }
 
-    ObjectPlace _placeOfRun(const Vma& vma, uint32_t tag, const OwnershipRun& run) {
+    ObjectPlace _placeOfRun(const Vma& vma, const Use& use, const OwnershipRun& run) {
         switch (run.owner) {
             case PageOwner::none:
                 return {};
@@ -256,10 +292,12 @@ private:
                 break;
         }
         const uint64_t window = run.start / MWFamilyWindow * MWFamilyWindow;
-        return {
-            _context.identity.family(
-                {.family = _family().identifier, .window = window, .tag = tag, .generation = run.generation}),
-            run.start};
+        return {_context.identity.family({.family = _family().identifier(),
+                                          .window = window,
+                                          .file = use.file,
+                                          .tag = use.file == 0 ? use.tag : MWTagNone,
+                                          .generation = run.generation}),
+                run.start};
     }
 
     const AddressSpaceOwner& _owner;
@@ -267,6 +305,7 @@ private:
     const AddressSpaceContext& _context;
     std::vector<AddressSpaceRegion>& _regions;
     ForkFamily* _knownFamily = nullptr;
+    uint64_t _partOfFamilyMemory = 0;
 };
 
 }  // namespace
@@ -290,7 +329,8 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
     if (shmemDevices.isShmem(vma.device(), processDirectory)) {
         return Backing::shmem;
     }
-    return startsWithAny(path, {"/dev/", "/dmabuf:"}) ? Backing::special : Backing::file;
+    return startsWithAny(path, {"/dev/", "/dmabuf:", "/[aio]", "/proc/", "/sys/"}) ? Backing::special
+                                                                                   : Backing::file;
 }
 
 AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
@@ -302,11 +342,16 @@ AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner
         backed.push_back({std::move(vma), backing});
     }
     const std::vector<uint32_t> tags = tagsForVmas(backed, context.names);
+    LinuxImages images = imagesOfVmas(backed);
     _regions.reserve(backed.size());
     RegionBuilder builder(owner, pages, context, _regions);
     for (size_t index = 0; index < backed.size(); ++index) {
-        builder.add(std::move(backed[index]), tags[index]);
+        const size_t image = images.imageOfVma[index];
+        builder.add(std::move(backed[index]), tags[index],
+                    image == LinuxImages::kNoImage ? nullptr : &images.images[image]);
     }
+    _images = std::move(images.images);
+    _partOfFamilyMemory = builder.partOfFamilyMemory();
 }
 
 const AddressSpaceRegion* AddressSpace::regionAtOrAbove(uint64_t address) const {

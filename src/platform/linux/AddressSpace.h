@@ -8,6 +8,7 @@
 
 #include "platform/MWHostRecords.h"
 #include "platform/linux/ForkFamily.h"
+#include "platform/linux/LinuxImages.h"
 #include "platform/linux/ObjectIdentity.h"
 #include "platform/linux/OwnershipRuns.h"
 #include "platform/linux/RegionNames.h"
@@ -54,11 +55,18 @@ public:
                  const AddressSpaceContext& context);
 
     const std::vector<AddressSpaceRegion>& regions() const { return _regions; }
+    /// The program and its libraries, ascending by base address.
+    const std::vector<LinuxImage>& images() const { return _images; }
+    /// The process's part of the memory that its fork family shares, in bytes, each divided by the number of
+    /// processes that map it; 0 when it shares none.
+    uint64_t partOfFamilyMemory() const { return _partOfFamilyMemory; }
     /// The region that holds `address`, else the first above it, else none. Costs a binary search.
     const AddressSpaceRegion* regionAtOrAbove(uint64_t address) const;
 
 private:
     std::vector<AddressSpaceRegion> _regions;
+    std::vector<LinuxImage> _images;
+    uint64_t _partOfFamilyMemory = 0;
 };
 
 /// Everything that a mapping's path, flags and device tell of its backing.

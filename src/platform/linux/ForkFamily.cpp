@@ -6,6 +6,7 @@
 #include <elf.h>
 #include <array>
 #include <cstring>
+#include <numeric>
 #include <string>
 
 #include "platform/linux/ProcText.h"
@@ -104,9 +105,19 @@ std::shared_ptr<ForkFamily> ForkFamilies::family(uint64_t identifier) {
     std::weak_ptr<ForkFamily>& known = _families[identifier];
     std::shared_ptr<ForkFamily> family = known.lock();
     if (family == nullptr) {
-        family = std::make_shared<ForkFamily>();
-        family->identifier = identifier;
+        family = std::make_shared<ForkFamily>(identifier);
         known = family;
     }
     return family;
+}
+
+void ForkFamily::setPart(int32_t pid, uint64_t bytes) {
+    const std::lock_guard lock(_mutex);
+    _parts[pid] = bytes;
+}
+
+uint64_t ForkFamily::sumOfParts() const {
+    const std::lock_guard lock(_mutex);
+    return std::accumulate(_parts.begin(), _parts.end(), uint64_t{0},
+                           [](uint64_t sum, const auto& part) { return sum + part.second; });
 }

@@ -11,9 +11,23 @@
 #include "platform/linux/ObjectIdentity.h"
 
 /// The processes of one exec, and what has been seen of the memory they share.
-struct ForkFamily {
-    uint64_t identifier = 0;
-    FrameGenerations generations;
+class ForkFamily {
+public:
+    explicit ForkFamily(uint64_t identifier) : _identifier(identifier) {}
+
+    uint64_t identifier() const { return _identifier; }
+    FrameGenerations& generations() { return _generations; }
+
+    /// Remembers a member's part of the memory that the family shares: its bytes, each divided by the number
+    /// of processes that map it. The parts of all members add up to the memory.
+    void setPart(int32_t pid, uint64_t bytes);
+    uint64_t sumOfParts() const;
+
+private:
+    uint64_t _identifier;
+    FrameGenerations _generations;
+    mutable std::mutex _mutex;
+    std::map<int32_t, uint64_t> _parts;
 };
 
 /// The families that processes of the run belong to. A family, and the memory it takes here, lives as long as

@@ -23,16 +23,20 @@ inline constexpr uint64_t MWFamilyWindow = 4ULL << 20U;
 ///
 /// For each window there is a table for each generation: the frame first seen at each of its pages. A page
 /// belongs to the first generation whose slot holds its frame or is still empty. Each distinct frame thus
-/// gets one (slot, generation), whichever process is read first. Safe for use from several threads.
+/// gets one (slot, generation), whichever process is read first. Where frames are hidden there is one
+/// generation. Safe for use from several threads.
 class FrameGenerations {
 public:
     struct Page {
         uint32_t slot = 0;   ///< page within the window, below MWFamilyWindow / page size
-        uint64_t frame = 0;  ///< frame number or swap entry, not 0
+        uint64_t frame = 0;  ///< frame number or swap entry; 0 where the kernel hides it
     };
 
     /// The generation of each page; all of them lie in the window at `window`, an address.
     void assign(uint64_t window, std::span<const Page> pages, std::span<uint16_t> generations);
+
+    /// The pages that have been told apart so far.
+    uint64_t pages() const;
 
 private:
     static constexpr size_t kSlots = MWFamilyWindow / 4096;
@@ -40,8 +44,9 @@ private:
     using Generation = std::array<uint32_t, kSlots>;
     using Window = std::vector<std::unique_ptr<Generation>>;
 
-    static uint16_t _assign(Window& window, const Page& page);
+    uint16_t _assign(Window& window, const Page& page);
 
-    std::mutex _mutex;
+    mutable std::mutex _mutex;
+    uint64_t _pages = 0;
     std::map<uint64_t, Window> _windows;
 };

@@ -173,7 +173,28 @@ kern_return_t LinuxTask::takeSnapshot() {
                                      .directory = _memoryDirectory(),
                                      .family = [this]() -> ForkFamily& { return _family(); }},
                    *_pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
+    if (owner.pid == _pid) {
+        _checkFamilyMemory();
+    }
     return KERN_SUCCESS;
+}
+
+// One generation is too few where a child rewrote memory and forked again: its frames are then joined with
+// the ones that its parent still shares. The members' parts do add up to all of them.
+void LinuxTask::_checkFamilyMemory() {
+    const uint64_t part = _space->partOfFamilyMemory();
+    if (part == 0 || _run.zeroFrame != 0) {
+        return;
+    }
+    ForkFamily& family = _family();
+    family.setPart(_pid, part);
+    const uint64_t joined = family.generations().pages() * _run.pageSize;
+    const uint64_t parts = family.sumOfParts();
+    constexpr uint64_t kTolerated = 1U << 20U;
+    if (parts > joined + joined / 64 + kTolerated) {
+        _warnings.push_back("Memory shared by fork may be under-counted by " +
+                            std::to_string(parts - joined) + " bytes: page frames are hidden (try as root?)");
+    }
 }
 
 void LinuxTask::dropSnapshot() {

@@ -5,6 +5,7 @@
 #include <optional>
 #include <span>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/MWHostRecords.h"
@@ -45,6 +46,8 @@ public:
     /// Takes a snapshot unless there is one. MACH_SEND_INVALID_DEST when the process has ended,
     /// KERN_INVALID_ADDRESS when it lives and has no memory of its own, KERN_FAILURE when the kernel refuses.
     kern_return_t takeSnapshot();
+    /// What is doubtful about the snapshots taken since the last call, a sentence each.
+    std::vector<std::string> takeWarnings() { return std::exchange(_warnings, {}); }
     bool hasSnapshot() const { return _space.has_value(); }
     /// There must be a snapshot.
     const AddressSpace& addressSpace() const { return *_space; }
@@ -63,6 +66,7 @@ private:
     bool _parseSmaps(std::vector<procfs::Vma>& vmas) const;
     kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) const;
     ForkFamily& _family();
+    void _checkFamilyMemory();
 
     LinuxRun& _run;
     int32_t _pid;
@@ -71,6 +75,7 @@ private:
     int32_t _threadId;                        ///< a thread that lives
     procfs::Descriptor _thread;               ///< its task/TID, when it is not the first one
     std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live
+    std::vector<std::string> _warnings;
     std::optional<LivePages> _pages;
     std::optional<AddressSpace> _space;
     PageDispositions _dispositions;

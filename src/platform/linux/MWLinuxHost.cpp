@@ -27,6 +27,22 @@ void raiseDescriptorLimit() {
     }
 }
 
+class LinuxImageDescription : public MWImageDescription {
+public:
+    explicit LinuxImageDescription(const LinuxImage& image) : _image(image) {}
+    // The kernel reports the file that is mapped, whichever links led to it.
+    std::string path() const override { return _image.path; }
+    uint64_t baseAddress() const override { return _image.baseAddress(); }
+    void forEachSegment(const std::function<void(const MWImageSegmentDescription&)>& block) const override {
+        for (const LinuxImage::Segment& segment : _image.segments) {
+            block({.name = segment.name, .start = segment.start, .length = segment.size});
+        }
+    }
+
+private:
+    const LinuxImage& _image;
+};
+
 uint64_t readClock(clockid_t clock) {
     constexpr uint64_t kNanosecondsPerSecond = 1'000'000'000;
     timespec time = {};
@@ -123,6 +139,11 @@ kern_return_t MWLinuxHost::mach_vm_region(task_t task, uint64_t& address, uint64
     return code;
 }
 
+std::vector<std::string> MWLinuxHost::takeTaskWarnings(task_t task) {
+    LinuxTask* record = _task(task);
+    return record == nullptr ? std::vector<std::string>{} : record->takeWarnings();
+}
+
 kern_return_t MWLinuxHost::mach_vm_purgable_control(task_t, uint64_t, int32_t, int32_t& state) {
     state = VM_PURGABLE_DENY;
     return KERN_SUCCESS;
@@ -171,8 +192,16 @@ std::optional<std::string> MWLinuxHost::describeRegionTypeForTag(uint32_t tag) {
     return _run.names.nameForTag(tag);
 }
 
-// Images are not listed: file mappings go by their paths.
-void MWLinuxHost::forEachImage(task_t, const std::function<void(const MWImageDescription&)>&) {}
+// A process that cannot be looked at has no images; the walk meets the same failure and reports it.
+void MWLinuxHost::forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) {
+    LinuxTask* record = _task(task);
+    if (record == nullptr || record->takeSnapshot() != KERN_SUCCESS) {
+        return;
+    }
+    for (const LinuxImage& image : record->addressSpace().images()) {
+        block(LinuxImageDescription(image));
+    }
+}
 
 // The control belongs to a kernel that keeps lists of owned objects; this one does not.
 int MWLinuxHost::sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) {

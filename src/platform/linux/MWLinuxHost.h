@@ -35,6 +35,7 @@ public:
 
     kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
                                          vm_region_submap_info_64& info, uint32_t& count) override;
+    std::vector<std::string> takeTaskWarnings(task_t task) override;
     kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                  vm_region_basic_info_64& info, uint32_t& count) override;
     /// Nothing on Linux is purgeable: always VM_PURGABLE_DENY.
@@ -68,6 +69,7 @@ public:
     void mach_error(std::string_view label, kern_return_t code) override;
 
     std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
+    /// From the task's snapshot, which is taken when there is none: the walk that follows goes on with it.
     void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
 
     int mach_get_times(MWClockReading& reading) override;

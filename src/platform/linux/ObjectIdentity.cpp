@@ -2,8 +2,6 @@
 
 #include <sodium/crypto_shorthash.h>
 
-#include <cstring>
-
 static_assert(crypto_shorthash_KEYBYTES == 16 && crypto_shorthash_BYTES == 8);
 
 namespace {
@@ -36,13 +34,11 @@ uint64_t ObjectIdentity::process(int32_t pid, uint64_t startTime, uint64_t addre
 
 uint64_t ObjectIdentity::family(const FamilyMemory& memory) const {
     const uint64_t detail = (uint64_t{memory.tag} << 32U) | memory.generation;
-    return _hash({kFamily, memory.family, memory.window, detail});
+    return _hash({kFamily, memory.family, memory.window, memory.file, detail});
 }
 
-uint64_t ObjectIdentity::_hash(const std::array<uint64_t, 4>& what) const {
-    std::array<char, sizeof(what)> raw = {};
-    std::memcpy(raw.data(), what.data(), raw.size());
-    return bytes({raw.data(), raw.size()});
+uint64_t ObjectIdentity::_hash(std::initializer_list<uint64_t> what) const {
+    return bytes({reinterpret_cast<const char*>(what.begin()), what.size() * sizeof(uint64_t)});
 }
 
 uint64_t ObjectIdentity::bytes(std::string_view bytes) const {

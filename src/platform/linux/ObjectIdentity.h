@@ -2,6 +2,7 @@
 
 #include <array>
 #include <cstdint>
+#include <initializer_list>
 #include <string_view>
 
 /// Numbers for what backs a mapping, equal exactly where two mappings show the same memory. A 64-bit keyed
@@ -23,6 +24,7 @@ public:
     struct FamilyMemory {
         uint64_t family;
         uint64_t window;
+        uint64_t file;  ///< whose data it is, by the file's identity; 0 for memory of no file
         uint32_t tag;
         uint32_t generation;
     };
@@ -31,7 +33,7 @@ public:
     uint64_t bytes(std::string_view bytes) const;
 
 private:
-    uint64_t _hash(const std::array<uint64_t, 4>& what) const;
+    uint64_t _hash(std::initializer_list<uint64_t> what) const;
 
     std::array<unsigned char, 16> _key = {};
 };

@@ -90,7 +90,7 @@ private:
         _framePages.clear();
         _framePositions.clear();
         for (size_t page = 0; page < entries.size(); ++page) {
-            if (_ownerships[page].owner == PageOwner::family && entries[page].frame() != 0) {
+            if (_ownerships[page].owner == PageOwner::family) {
                 const uint64_t slot = (start - window) / _question.pageSize + page;
                 _framePages.push_back({static_cast<uint32_t>(slot), entries[page].frame()});
                 _framePositions.push_back(page);

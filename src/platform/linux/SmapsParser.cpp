@@ -28,7 +28,7 @@ constexpr std::array<Field, 12> kFields = {{{"Rss", &Vma::rss},
                                             {"Swap", &Vma::swap},
                                             {"SwapPss", &Vma::swapPss}}};
 
-constexpr std::array<std::pair<std::string_view, VmFlag>, 10> kFlags = {{{"mr", VmFlagMayRead},
+constexpr std::array<std::pair<std::string_view, VmFlag>, 12> kFlags = {{{"mr", VmFlagMayRead},
                                                                          {"mw", VmFlagMayWrite},
                                                                          {"me", VmFlagMayExecute},
                                                                          {"lo", VmFlagLocked},
@@ -37,7 +37,9 @@ constexpr std::array<std::pair<std::string_view, VmFlag>, 10> kFlags = {{{"mr", 
                                                                          {"nh", VmFlagNoHugepage},
                                                                          {"io", VmFlagIo},
                                                                          {"pf", VmFlagPfnMap},
-                                                                         {"gd", VmFlagGrowsDown}}};
+                                                                         {"gd", VmFlagGrowsDown},
+                                                                         {"nr", VmFlagNoReserve},
+                                                                         {"ss", VmFlagShadowStack}}};
 
 // A line of a mapping holds one path, of at most 4096 bytes of which each can be written as four.
 constexpr size_t kLongestLine = 5 * 4096;

@@ -10,16 +10,18 @@ namespace procfs {
 
 /// What the VmFlags line of smaps says, as far as it is used.
 enum VmFlag : uint32_t {
-    VmFlagMayRead = 1U << 0U,      // mr
-    VmFlagMayWrite = 1U << 1U,     // mw
-    VmFlagMayExecute = 1U << 2U,   // me
-    VmFlagLocked = 1U << 3U,       // lo
-    VmFlagHugetlb = 1U << 4U,      // ht
-    VmFlagAccountable = 1U << 5U,  // ac: charged to the commit limit, so it was writable once
-    VmFlagNoHugepage = 1U << 6U,   // nh: MAP_STACK shows so since 6.7
-    VmFlagIo = 1U << 7U,           // io
-    VmFlagPfnMap = 1U << 8U,       // pf
-    VmFlagGrowsDown = 1U << 9U,    // gd
+    VmFlagMayRead = 1U << 0U,       // mr
+    VmFlagMayWrite = 1U << 1U,      // mw
+    VmFlagMayExecute = 1U << 2U,    // me
+    VmFlagLocked = 1U << 3U,        // lo
+    VmFlagHugetlb = 1U << 4U,       // ht
+    VmFlagAccountable = 1U << 5U,   // ac: charged to the commit limit, so it was writable once
+    VmFlagNoHugepage = 1U << 6U,    // nh: MAP_STACK shows so since 6.7
+    VmFlagIo = 1U << 7U,            // io
+    VmFlagPfnMap = 1U << 8U,        // pf
+    VmFlagGrowsDown = 1U << 9U,     // gd
+    VmFlagNoReserve = 1U << 10U,    // nr: mapped with MAP_NORESERVE
+    VmFlagShadowStack = 1U << 11U,  // ss, since 6.6
 };
 
 /// One mapping, as a line of `maps` and the lines that `smaps` adds to it tell. Sizes are bytes.
