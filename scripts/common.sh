@@ -47,8 +47,9 @@ install_dependencies() {
 
 # One build at a time: several scripts may be started at once.
 with_build_lock() {
-    mkdir -p "$release" 2>/dev/null && [[ -w $release ]] ||
+    if ! mkdir -p "$release" 2>/dev/null || [[ ! -w $release ]]; then
         fail "$release cannot be written by this user: build once as its owner, with scripts/build"
+    fi
     (
         cd "$top" && flock 9 && "$@"
     ) 9>"$release/.lock"

@@ -202,7 +202,9 @@ MWMemweightArgs::Outcome MWMemweightArgs::_applyPid(const char* argument) {
 MWMemweightArgs::Outcome MWMemweightArgs::_applySample(const std::string& argument) {
     // from_chars rather than strtod: decimal only, and the same in every locale.
     double seconds = 0;
-    std::from_chars(argument.data(), argument.data() + argument.size(), seconds);
+    const size_t blanks = std::min(argument.find_first_not_of(" \t\n"), argument.size());
+    const size_t start = argument.substr(blanks).starts_with('+') ? blanks + 1 : blanks;
+    std::from_chars(argument.data() + start, argument.data() + argument.size(), seconds);
     if (!std::isnormal(seconds) || seconds < 0) {
         return failure(MWErrorSample, fmt::format("Invalid sampling interval '{}'", argument));
     }

@@ -9,6 +9,7 @@
 
 #include "cli/MWMemweightArgs.h"
 #include "platform/MWHostInterface.h"
+#include "platform/MWTerminalText.h"
 
 namespace {
 
@@ -37,7 +38,8 @@ tl::expected<std::shared_ptr<MWProcess>, std::string> openHeapsnap(const std::st
 
 void reportUnreadable(int32_t pid, const std::optional<std::string>& name) {
     if (name) {
-        fmt::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", *name, pid);
+        fmt::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", MWTerminalText(*name),
+                     pid);
     } else {
         fmt::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", pid);
     }

@@ -1,7 +1,25 @@
+#include <fcntl.h>
+#include <unistd.h>
+
 #include "cli/MWEntry.h"
 #include "platform/linux/MWLinuxHost.h"
 
+namespace {
+
+// A file opened later must not take the place of a standard stream that the caller closed: the report would
+// be written into it.
+void fillStandardDescriptors() {
+    int descriptor = 0;
+    do {
+        descriptor = open("/dev/null", O_RDWR);
+    } while (descriptor >= 0 && descriptor <= STDERR_FILENO);
+    close(descriptor);
+}
+
+}  // namespace
+
 int main(int argc, char* argv[]) {
+    fillStandardDescriptors();
     MWLinuxHost host;
     MWHostInterface::setCurrent(&host);
     return MWMemweightMain(argc, argv);

@@ -56,7 +56,8 @@ public:
     virtual void printProcessTotal(uint64_t memweight, const MWProcess& forProcess) = 0;
     /// Memory that the process of the last header holds alone.
     virtual void printProcessCategories(const MWCategoryTable& categories, const MWCategoryTotals& total) = 0;
-    virtual void printSharedCategories(const MWCategoryTable& categories, const MWSharedCategoriesCall& call) = 0;
+    virtual void printSharedCategories(const MWCategoryTable& categories,
+                                       const MWSharedCategoriesCall& call) = 0;
     /// The last call about a process; the data may be none.
     virtual void printProcessAuxData(const MWAuxDataTree& auxData) = 0;
     virtual void printProcessesWithWarnings(const std::vector<const MWProcess*>& processes,

@@ -6,8 +6,8 @@
 #include <utility>
 
 #include "analysis/MWProcessGroup.h"
-#include "output/MWTerminalText.h"
 #include "platform/MWPhysMemweightSwitch.h"
+#include "platform/MWTerminalText.h"
 #include "process/MWProcess.h"
 
 namespace {

@@ -8,8 +8,8 @@
 #include <cstddef>
 
 #include "output/MWOutputFormatterText.h"
-#include "output/MWTerminalText.h"
 #include "platform/MWInvariant.h"
+#include "platform/MWTerminalText.h"
 
 namespace {
 

@@ -27,25 +27,31 @@ sigset_t interruptSet() {
 // threads whose work an interrupt is to outlive.
 MWInterruptSource::MWInterruptSource(std::function<void()> handler) : _handler(std::move(handler)) {
     const sigset_t set = interruptSet();
-    pthread_sigmask(SIG_BLOCK, &set, nullptr);
-    _signals = signalfd(-1, &set, SFD_CLOEXEC);
+    _signals = signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK);
     _cancelled = eventfd(0, EFD_CLOEXEC);
-    _thread = std::thread([this] { _deliver(); });
+    if (_signals >= 0 && _cancelled >= 0) {
+        pthread_sigmask(SIG_BLOCK, &set, nullptr);
+        _thread = std::thread([this] { _deliver(); });
+    }
 }
 
 MWInterruptSource::~MWInterruptSource() {
     cancel();
+    close(_signals);
+    close(_cancelled);
 }
 
+// What has arrived before the cancellation is delivered.
 void MWInterruptSource::_deliver() {
     std::array<pollfd, 2> waits = {{{_cancelled, POLLIN, 0}, {_signals, POLLIN, 0}}};
     while (poll(waits.data(), waits.size(), -1) >= 0 || errno == EINTR) {
-        if ((waits[0].revents & POLLIN) != 0) {
-            return;
-        }
+        const bool cancelled = (waits[0].revents & POLLIN) != 0;
         signalfd_siginfo signal = {};
-        if ((waits[1].revents & POLLIN) != 0 && read(_signals, &signal, sizeof(signal)) == sizeof(signal)) {
+        while (read(_signals, &signal, sizeof(signal)) == sizeof(signal)) {
             _handler();
+        }
+        if (cancelled) {
+            return;
         }
     }
 }
@@ -56,9 +62,9 @@ void MWInterruptSource::cancel() {
     }
     eventfd_write(_cancelled, 1);
     _thread.join();
-    close(_signals);
-    close(_cancelled);
-    std::signal(SIGINT, SIG_DFL);
+    // Ignoring a signal discards one that is pending: it came while the interrupt was still being handled.
+    std::signal(SIGINT, SIG_IGN);
     const sigset_t set = interruptSet();
     pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
+    std::signal(SIGINT, SIG_DFL);
 }

@@ -6,6 +6,7 @@
 /// Delivers SIGINT to a handler on a thread of its own, outside signal context, once for each interrupt.
 /// From its creation on SIGINT no longer ends the process. `cancel` (or the destructor) stops the delivery;
 /// when it returns the handler is not running and will not run again, and SIGINT has its default action.
+/// Where no descriptors are left, nothing is delivered and SIGINT keeps its default action.
 class MWInterruptSource {
 public:
     explicit MWInterruptSource(std::function<void()> handler);

@@ -191,7 +191,7 @@ std::shared_ptr<MWProcess> MWProcess::processWithPid(int32_t pid) {
 
 std::shared_ptr<MWProcess> MWProcess::processWithBsdInfo(const proc_bsdinfo& info) {
     if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
-        // The kernel has no address space that a task could be acquired for.
+        // Measuring the kernel is not built yet; as the only target it is refused with a message.
         return nullptr;
     }
     return MWUserProcess::initWithBsdInfo(info);

@@ -8,6 +8,7 @@
 #include <system_error>
 
 #include "platform/MWHostInterface.h"
+#include "platform/MWTerminalText.h"
 
 namespace {
 
@@ -100,7 +101,7 @@ void MWUserProcess::gatherData() {
     }
     if (!_configurePageSize()) {
         fmt::fprintf(stderr, "skipping process %s due to an error configuring page size for analysis\n",
-                     displayString());
+                     MWTerminalText(displayString()));
         return;
     }
     if (!hiddenFromDisplay()) {
@@ -138,10 +139,11 @@ void MWUserProcess::_addTaskWarnings() {
 void MWUserProcess::_addErrnoWarningWithDescription(std::string_view description) {
     const std::string text = std::generic_category().message(errno).substr(0, kLongestErrorText);
     std::string message = fmt::format("{}: {} - {}", displayString(), description, text);
-    fmt::print(stderr, "{}\n", message);
+    fmt::fprintf(stderr, "%s\n", MWTerminalText(message));
     _addWarning(std::move(message));
 }
 
 void MWUserProcess::_printBailingOut() const {
-    fmt::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString());
+    fmt::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
+                 MWTerminalText(displayString()));
 }

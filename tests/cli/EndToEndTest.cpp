@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 #include <sys/mman.h>
+#include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -103,6 +104,9 @@ Report memweight(const std::string& arguments, const std::string& prefix = "") {
     const std::string command = prefix + MEMWEIGHT_BINARY + " -f bytes " + arguments + " 2>&1";
     Report report;
     std::FILE* output = popen(command.c_str(), "r");
+    if (output == nullptr) {
+        return report;
+    }
     std::array<char, 4096> buffer = {};
     for (size_t count = 0; (count = fread(buffer.data(), 1, buffer.size(), output)) != 0;) {
         report.text.append(buffer.data(), count);
@@ -167,6 +171,7 @@ TEST(EndToEnd, ChildrenAreTargetsWithTheirParent) {
     const ChildProcess child([] {
         const pid_t grandchild = fork();
         if (grandchild == 0) {
+            prctl(PR_SET_PDEATHSIG, SIGKILL);
             while (true) {
                 pause();
             }
@@ -175,10 +180,34 @@ TEST(EndToEnd, ChildrenAreTargetsWithTheirParent) {
     });
     const std::string pid = std::to_string(child.pid());
     const std::string grandchild = std::to_string(child.answer());
-    EXPECT_NE(memweight("-t --pid " + pid).text.find("[" + grandchild + "]: 64-bit"), std::string::npos);
+    const Report both = memweight("-t --pid " + pid);
+    EXPECT_EQ(both.status, 0);
+    EXPECT_NE(both.text.find("[" + grandchild + "]: 64-bit"), std::string::npos) << both.text;
     const Report without = memweight("-t --pid " + pid + " -x " + grandchild);
-    EXPECT_EQ(without.text.find("[" + grandchild + "]"), std::string::npos);
+    EXPECT_EQ(without.status, 0);
+    EXPECT_NE(without.text.find("[" + pid + "]: 64-bit"), std::string::npos) << without.text;
+    EXPECT_EQ(without.text.find("[" + grandchild + "]"), std::string::npos) << without.text;
     kill(static_cast<pid_t>(child.answer()), SIGKILL);
+}
+
+TEST(EndToEnd, FormsOfTheReport) {
+    const ChildProcess child;
+    const std::string pid = std::to_string(child.pid());
+    const Report wide = memweight("-w -f formatted --sort category " + pid);
+    EXPECT_EQ(wide.status, 0);
+    EXPECT_TRUE(wide.text.starts_with(std::string(90, '=') + "\n")) << wide.text;
+    EXPECT_LT(wide.text.find(" __DATA"), wide.text.find(" stack")) << "in the order of the names";
+    EXPECT_NE(memweight("-f pages --sort clean " + pid).text.find(" pages (4096 bytes per page)"),
+              std::string::npos);
+    const Report named = memweight("-s cli_tests");
+    EXPECT_EQ(named.status, 0);
+    EXPECT_NE(named.text.find("cli_tests [" + pid + "]: 64-bit"), std::string::npos) << named.text;
+    if (geteuid() == 0) {
+        const Report all = memweight("-a");
+        EXPECT_EQ(all.status, 0);
+        EXPECT_FALSE(all.table("Summary").rows.empty()) << all.text;
+        EXPECT_EQ(memweight("--unmapped " + pid).status, 0);
+    }
 }
 
 TEST(EndToEnd, FailuresAreTold) {

@@ -6,7 +6,6 @@
 #include <ctime>
 
 #include "output/MWDateFormatter.h"
-#include "output/MWTerminalText.h"
 #include "support/FakeHost.h"
 
 TEST(MWTime, ReadsThreeClocksAtOnce) {
@@ -46,16 +45,4 @@ TEST(MWDateFormatter, WritesLocalTimeWithItsOffset) {
     EXPECT_EQ(text("UTC0", instant, 999999000), "2024-03-05 22:07:10.000Z") << "rounding carries";
     unsetenv("TZ");
     tzset();
-}
-
-TEST(MWTerminalText, LetsNothingThroughThatSteersATerminal) {
-    EXPECT_EQ(MWTerminalText("plain \"text\" ~"), "plain \"text\" ~");
-    EXPECT_EQ(MWTerminalText("\x1b[31mred\n\t\x7f"), "?[31mred???");
-    EXPECT_EQ(MWTerminalText("é \u20ac \U0001F600"), "é \u20ac \U0001F600");
-    EXPECT_EQ(MWTerminalText("\u009b31m"), "??31m") << "the control sequence introducer as UTF-8";
-    EXPECT_EQ(MWTerminalText("\x9b"
-                             "31m\xff"),
-              "?31m?");
-    EXPECT_EQ(MWTerminalText("cut \xe2\x82"), "cut ??");
-    EXPECT_EQ(MWTerminalText("\xc1\x9b \xe0\x82\x9b \xf0\x80\x80\x80"), "?? ??? ????") << "overlong forms";
 }

@@ -12,6 +12,8 @@
 #include <linux/sched.h>
 #include <cerrno>
 #include <csignal>
+#include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <thread>
 
@@ -278,18 +280,21 @@ TEST(LinuxHost, ReadsTheKernelsOwnFigures) {
 
 TEST(LinuxHost, RemovesRegularFilesOnly) {
     MWLinuxHost host;
-    const std::string file = testing::TempDir() + "memweight-file";
-    const std::string fifo = testing::TempDir() + "memweight-fifo";
+    std::string directory = testing::TempDir() + "memweight-XXXXXX";
+    ASSERT_NE(mkdtemp(directory.data()), nullptr);
+    const std::string file = directory + "/file";
+    const std::string link = directory + "/link";
+    const std::string fifo = directory + "/fifo";
     std::ofstream(file) << "x";
     ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
-    EXPECT_TRUE(host.fileExists(file));
+    ASSERT_EQ(symlink(file.c_str(), link.c_str()), 0);
+    for (const std::string& path : {link, fifo, std::string("/dev/null")}) {
+        host.unlinkRegularFile(path);
+        EXPECT_TRUE(host.fileExists(path)) << path;
+    }
     host.unlinkRegularFile(file);
-    host.unlinkRegularFile(fifo);
-    host.unlinkRegularFile("/dev/null");
     EXPECT_FALSE(host.fileExists(file));
-    EXPECT_TRUE(host.fileExists(fifo));
-    EXPECT_TRUE(host.fileExists("/dev/null"));
-    unlink(fifo.c_str());
+    std::filesystem::remove_all(directory);
 }
 
 }  // namespace

@@ -46,7 +46,8 @@ std::vector<uint32_t> tagsOf(const std::vector<Row>& rows) {
         smaps += smapsOf(row);
     }
     RegionNames names;
-    return tagsForVmas(backedVmas(smaps), names);
+    const std::vector<BackedVma> vmas = backedVmas(smaps);
+    return tagsForVmas(vmas, imagesOfVmas(vmas), names);
 }
 
 void expectTags(const std::vector<Row>& rows) {
@@ -325,7 +326,8 @@ TEST(RegionTagsTest, AnySequenceOfMappingsIsTagged) {
             smaps += smapsOf({mapping.c_str(), 4, pick(flags), MWTagNone, pick(paths)});
         }
         RegionNames names;
-        const std::vector<uint32_t> tags = tagsForVmas(backedVmas(smaps), names);
+        const std::vector<BackedVma> vmas = backedVmas(smaps);
+        const std::vector<uint32_t> tags = tagsForVmas(vmas, imagesOfVmas(vmas), names);
         ASSERT_EQ(tags.size(), count);
         for (const uint32_t tag : tags) {
             EXPECT_LE(tag, MWTagLastDynamic) << smaps;

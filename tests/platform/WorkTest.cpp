@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -49,6 +50,34 @@ TEST(InterruptSource, DeliversEachInterruptUntilItIsCancelled) {
     source.cancel();
     EXPECT_FALSE(delivered.try_acquire());
     EXPECT_EXIT(raise(SIGINT), testing::KilledBySignal(SIGINT), "") << "the default action is back";
+}
+
+TEST(InterruptSource, AnInterruptThatArrivedBeforeItWasCancelledIsNotLeftToTheDefaultAction) {
+    std::counting_semaphore<> entered(0);
+    std::counting_semaphore<> leave(0);
+    MWInterruptSource source([&] {
+        entered.release();
+        leave.acquire();
+    });
+    ASSERT_EQ(kill(getpid(), SIGINT), 0);
+    entered.acquire();
+    ASSERT_EQ(kill(getpid(), SIGINT), 0);
+    leave.release(2);
+    source.cancel();
+    EXPECT_TRUE(entered.try_acquire()) << "it was delivered";
+}
+
+TEST(InterruptSource, WithoutDescriptorsItDeliversNothingAndEnds) {
+    rlimit before = {};
+    getrlimit(RLIMIT_NOFILE, &before);
+    rlimit none = before;
+    none.rlim_cur = 0;
+    setrlimit(RLIMIT_NOFILE, &none);
+    {
+        MWInterruptSource source([] { FAIL(); });
+    }
+    setrlimit(RLIMIT_NOFILE, &before);
+    EXPECT_EXIT(raise(SIGINT), testing::KilledBySignal(SIGINT), "");
 }
 
 TEST(Invariant, StopsTheProgramWithItsText) {

@@ -341,8 +341,8 @@ AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner
         const Backing backing = backingOf(vma, context.shmemDevices, owner.directory);
         backed.push_back({std::move(vma), backing});
     }
-    const std::vector<uint32_t> tags = tagsForVmas(backed, context.names);
     LinuxImages images = imagesOfVmas(backed);
+    const std::vector<uint32_t> tags = tagsForVmas(backed, images, context.names);
     _regions.reserve(backed.size());
     RegionBuilder builder(owner, pages, context, _regions);
     for (size_t index = 0; index < backed.size(); ++index) {

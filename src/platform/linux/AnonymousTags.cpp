@@ -58,7 +58,7 @@ ProgramTraits::ProgramTraits(const std::vector<BackedVma>& vmas) {
     const Vma* previous = nullptr;
     for (const BackedVma& backed : vmas) {
         const Vma& vma = backed.vma;
-        if (backed.backing == Backing::file && vma.executable && _images.insert(vma.path).second) {
+        if (backed.backing == Backing::file && vma.executable) {
             _addImage(fileName(vma.path));
         }
         _sanitizerShadow = _sanitizerShadow || startsAt(backed, kShadowStart);
@@ -78,8 +78,8 @@ void ProgramTraits::_addImage(std::string_view name) {
     _mimalloc = _mimalloc || name.starts_with("libmimalloc.so") || name.starts_with("libmimalloc-secure.so");
 }
 
-AnonymousTagger::AnonymousTagger(const std::vector<BackedVma>& vmas)
-    : _vmas(vmas), _traits(vmas), _goHeapEnd(goHeapEnd(vmas)) {}
+AnonymousTagger::AnonymousTagger(const std::vector<BackedVma>& vmas, const LinuxImages& images)
+    : _vmas(vmas), _images(images), _traits(vmas), _goHeapEnd(goHeapEnd(vmas)) {}
 
 struct AnonymousTagger::Rule {
     bool (AnonymousTagger::*holds)(size_t) const;
@@ -221,14 +221,8 @@ bool AnonymousTagger::_isSanitizerShadow(size_t index) const {
            _vma(index).end <= kShadowEnd && _vma(index).has(procfs::VmFlagNoReserve);
 }
 
-// The loader maps the part of an image's data that the file does not hold right behind the part it does.
 bool AnonymousTagger::_isBss(size_t index) const {
-    if (index == 0 || !_vma(index).writable) {
-        return false;
-    }
-    const BackedVma& data = _vmas[index - 1];
-    return data.vma.end == _vma(index).start && data.backing == Backing::file && data.vma.writable &&
-           !data.vma.shared && _traits.isImage(data.vma.path);
+    return _images.imageOfVma[index] != LinuxImages::kNoImage;
 }
 
 bool AnonymousTagger::_isGoHeap(size_t index) const {

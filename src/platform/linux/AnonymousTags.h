@@ -3,19 +3,16 @@
 #include <cstddef>
 #include <cstdint>
 #include <string_view>
-#include <unordered_set>
 #include <vector>
 
-#include "platform/linux/RegionTags.h"
+#include "platform/linux/BackedVma.h"
+#include "platform/linux/LinuxImages.h"
 
-/// What the mapped files and fixed addresses of a process tell of what runs in it. Looks at each mapping once
-/// and keeps views of their paths.
+/// What the mapped files and fixed addresses of a process tell of what runs in it. Looks at each mapping
+/// once.
 class ProgramTraits {
 public:
     explicit ProgramTraits(const std::vector<BackedVma>& vmas);
-
-    /// A file of which a part is mapped executable.
-    bool isImage(std::string_view path) const { return _images.contains(path); }
 
     bool runsJava() const { return _java; }
     bool runsNode() const { return _node; }
@@ -31,7 +28,6 @@ public:
 private:
     void _addImage(std::string_view name);
 
-    std::unordered_set<std::string_view> _images;
     bool _java = false;
     bool _node = false;
     bool _python = false;
@@ -48,7 +44,7 @@ private:
 /// start.
 class AnonymousTagger {
 public:
-    explicit AnonymousTagger(const std::vector<BackedVma>& vmas);
+    AnonymousTagger(const std::vector<BackedVma>& vmas, const LinuxImages& images);
 
     /// The tag of the mapping at this place, whose backing is anonymous.
     uint32_t tag(size_t index) const;
@@ -86,6 +82,7 @@ private:
     bool _isReadOnly(size_t index) const;
 
     const std::vector<BackedVma>& _vmas;
+    const LinuxImages& _images;
     ProgramTraits _traits;
     uint64_t _goHeapEnd = 0;  ///< where the contiguous mappings from Go's first heap address end
 };

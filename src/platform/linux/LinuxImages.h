@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/RegionTags.h"
+#include "platform/linux/BackedVma.h"
 
 /// A file that a process runs code of, its program or a library, and where it is mapped. The mappings of one
 /// file are one image, however often it was loaded.

@@ -131,8 +131,9 @@ uint32_t tagForSpecial(const Vma& vma) {
 
 }  // namespace
 
-std::vector<uint32_t> tagsForVmas(const std::vector<BackedVma>& vmas, RegionNames& names) {
-    const AnonymousTagger anonymous(vmas);
+std::vector<uint32_t> tagsForVmas(const std::vector<BackedVma>& vmas, const LinuxImages& images,
+                                  RegionNames& names) {
+    const AnonymousTagger anonymous(vmas, images);
     const auto tagOf = [&](size_t index) -> uint32_t {
         const auto& [vma, backing] = vmas[index];
         if (const std::string_view name = givenName(vma.path); !name.empty()) {

@@ -3,23 +3,11 @@
 #include <cstdint>
 #include <vector>
 
+#include "platform/linux/BackedVma.h"
+#include "platform/linux/LinuxImages.h"
 #include "platform/linux/RegionNames.h"
-#include "platform/linux/SmapsParser.h"
-
-/// What holds a mapping's pages.
-enum class Backing : uint8_t {
-    anonymous,
-    file,   ///< a file on a disk or network
-    shmem,  ///< memfd, SysV, shared anonymous, tmpfs: only swap can take its pages
-    hugetlb,
-    special,  ///< the kernel's own mappings and devices
-};
-
-/// A mapping with its backing. The mappings of one process are ascending.
-struct BackedVma {
-    procfs::Vma vma;
-    Backing backing = Backing::anonymous;
-};
 
 /// The allocation tag of each mapping, from its path, its flags and its neighbours; in the same order.
-std::vector<uint32_t> tagsForVmas(const std::vector<BackedVma>& vmas, RegionNames& names);
+/// `images` are those of the same mappings.
+std::vector<uint32_t> tagsForVmas(const std::vector<BackedVma>& vmas, const LinuxImages& images,
+                                  RegionNames& names);

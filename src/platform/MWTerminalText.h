@@ -3,6 +3,6 @@
 #include <string>
 #include <string_view>
 
-/// `text` with everything that could steer a terminal, and every byte that is not part of well-formed UTF-8,
+/// `text` with every control character, and every byte that is not part of well-formed UTF-8,
 /// replaced by '?'. Names and paths come from the measured processes, which may choose them freely.
 std::string MWTerminalText(std::string_view text);

@@ -1,4 +1,4 @@
-#include "output/MWTerminalText.h"
+#include "platform/MWTerminalText.h"
 
 #include <algorithm>
 #include <cstddef>
@@ -40,7 +40,8 @@ size_t printableLength(std::string_view text) {
     const uint8_t second = byteAt(text, 1);
     const bool isC1Control = first == 0xC2 && second < 0xA0;
     const bool isOverlong = (first == 0xE0 && second < 0xA0) || (first == 0xF0 && second < 0x90);
-    return isC1Control || isOverlong ? 0 : length;
+    const bool isNoCharacter = (first == 0xED && second >= 0xA0) || (first == 0xF4 && second >= 0x90);
+    return isC1Control || isOverlong || isNoCharacter ? 0 : length;
 }
 
 }  // namespace
