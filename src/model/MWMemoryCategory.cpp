@@ -13,9 +13,9 @@ void MWMemoryCategory::addMemoryObject(std::shared_ptr<const MWMemoryObject> obj
 }
 
 std::optional<std::string> MWMemoryCategory::detailedName() const {
-    return _isSummary ? std::nullopt : _firstMemoryObject->detailedName();
+    return _isSummary ? std::nullopt : _namingObject().detailedName();
 }
 
 std::string MWMemoryCategory::fullName() const {
-    return _isSummary ? name() : _firstMemoryObject->fullName();
+    return _isSummary ? name() : _namingObject().fullName();
 }

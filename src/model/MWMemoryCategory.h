@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "model/MWMemoryObject.h"
+#include "platform/MWInvariant.h"
 
 /// One row of a category table: the sums over the memory objects (or views of objects) of one name. Named by
 /// the first object added. Adding an object twice counts it twice; callers do not.
@@ -20,11 +21,11 @@ public:
     void addMemoryObject(std::shared_ptr<const MWMemoryObject> object);
 
     bool isSummary() const { return _isSummary; }
-    const std::string& name() const { return _firstMemoryObject->name(); }
+    const std::string& name() const { return _namingObject().name(); }
     std::optional<std::string> detailedName() const;
     std::string fullName() const;
     /// Shown only in verbose output.
-    bool verbose() const { return _firstMemoryObject->verbose(); }
+    bool verbose() const { return _namingObject().verbose(); }
     const std::shared_ptr<const MWMemoryObject>& firstMemoryObject() const { return _firstMemoryObject; }
 
     int32_t totalRegions() const { return _totalRegions; }
@@ -44,6 +45,11 @@ public:
     }
 
 private:
+    const MWMemoryObject& _namingObject() const {
+        MW_INVARIANT(_firstMemoryObject != nullptr, "a category without objects has no name");
+        return *_firstMemoryObject;
+    }
+
     bool _isSummary = false;
     int32_t _totalRegions = 0;
     uint64_t _totalDirtySize = 0;

@@ -14,6 +14,7 @@ inline constexpr kern_return_t KERN_SUCCESS = 0;
 inline constexpr kern_return_t KERN_INVALID_ADDRESS = 1;
 inline constexpr kern_return_t KERN_INVALID_ARGUMENT = 4;
 inline constexpr kern_return_t KERN_FAILURE = 5;
+inline constexpr kern_return_t KERN_RESOURCE_SHORTAGE = 6;
 /// The task is gone.
 inline constexpr kern_return_t MACH_SEND_INVALID_DEST = 0x10000003;
 

@@ -22,15 +22,15 @@ sigset_t interruptSet() {
 
 }  // namespace
 
-// An ignored signal never reaches a signalfd, so SIGINT is blocked instead: it neither ends the process nor
-// gets lost. Threads made from now on inherit the mask, which is why the source must be made before the
-// threads whose work an interrupt is to outlive.
+// Blocked, SIGINT is queued for the signalfd even while it is ignored; ignored, it ends no thread that was
+// made before and does not block it.
 MWInterruptSource::MWInterruptSource(std::function<void()> handler) : _handler(std::move(handler)) {
     const sigset_t set = interruptSet();
     _signals = signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK);
     _cancelled = eventfd(0, EFD_CLOEXEC);
     if (_signals >= 0 && _cancelled >= 0) {
         pthread_sigmask(SIG_BLOCK, &set, nullptr);
+        std::signal(SIGINT, SIG_IGN);
         _thread = std::thread([this] { _deliver(); });
     }
 }
@@ -62,8 +62,7 @@ void MWInterruptSource::cancel() {
     }
     eventfd_write(_cancelled, 1);
     _thread.join();
-    // Ignoring a signal discards one that is pending: it came while the interrupt was still being handled.
-    std::signal(SIGINT, SIG_IGN);
+    // One that comes between here and there is discarded: it is still ignored when it is unblocked.
     const sigset_t set = interruptSet();
     pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
     std::signal(SIGINT, SIG_DFL);

@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <system_error>
 #include <thread>
 #include <utility>
 #include <vector>
@@ -47,7 +48,14 @@ void MWConcurrentQueue::apply(size_t count, const std::function<void(size_t)>& w
     const size_t width = std::min<size_t>(count, std::max(1U, std::thread::hardware_concurrency()));
     std::vector<std::jthread> threads;
     threads.reserve(width);
-    for (size_t i = 0; i < width; ++i) {
-        threads.emplace_back(drain);
+    try {
+        while (threads.size() < width) {
+            threads.emplace_back(drain);
+        }
+    } catch (const std::system_error&) {
+        // No more threads to be had: those that there are do the work, in the last resort this one.
+        if (threads.empty()) {
+            drain();
+        }
     }
 }

@@ -96,7 +96,8 @@ void MWUserProcess::enumerateRegions(const MWRegionCallback& callback) {
         const bool isFake = region.info.user_tag == MWFakeRegionTag;
         // Owned memory without an address is reported behind the last real region, and nothing counts after
         // it.
-        if (step == WalkStep::end || (fakeRegionSeen && !isFake) || !_leadsOnFrom(address, region)) {
+        if (step == WalkStep::end || (step == WalkStep::region && fakeRegionSeen && !isFake) ||
+            !_leadsOnFrom(address, region)) {
             return;
         }
         address = region.address + region.size;

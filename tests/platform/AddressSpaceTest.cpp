@@ -96,6 +96,42 @@ TEST_F(AddressSpaceTest, HugePagesAreResidentWiredAndDirty) {
     EXPECT_EQ(region.info.user_tag, MWTagHugetlb);
 }
 
+TEST_F(AddressSpaceTest, HugePagesRewrittenAfterForkAreNoLongerOneObject) {
+    const auto smaps = [](const std::string& counts) {
+        return "7f0000000000-7f0000400000 rw-p 00000000 00:0f 12 /anon_hugepage (deleted)\n" + counts +
+               "VmFlags: rd wr ht \n";
+    };
+    const auto identity = [&](const std::string& counts, int32_t pid) {
+        return only(smaps(counts), pid).info.object_id_full;
+    };
+    EXPECT_EQ(identity("Shared_Hugetlb: 4096 kB\n", 10), identity("Shared_Hugetlb: 4096 kB\n", 11));
+    EXPECT_NE(identity("Private_Hugetlb: 4096 kB\n", 10), identity("Private_Hugetlb: 4096 kB\n", 11));
+
+    for (uint64_t page = 0; page < 1024; ++page) {
+        _pages.pages[0x7f0000000000 + page * kPage] = {(uint64_t{1} << 63U) |
+                                                       (page < 512 ? 0 : uint64_t{1} << 56U)};
+    }
+    const AddressSpace mixed = build(smaps("Shared_Hugetlb: 2048 kB\nPrivate_Hugetlb: 2048 kB\n"));
+    ASSERT_EQ(mixed.regions().size(), 2U);
+    EXPECT_EQ(mixed.regions()[0].info.share_mode, SM_COW);
+    EXPECT_EQ(mixed.regions()[0].info.pages_dirtied, 512U);
+    EXPECT_EQ(mixed.regions()[1].info.share_mode, SM_PRIVATE);
+    EXPECT_EQ(mixed.regions()[1].info.pages_dirtied, 512U);
+}
+
+TEST_F(AddressSpaceTest, LazilyFreedPagesCountAsDirtyWhileTheyAreShared) {
+    for (uint64_t page = 0; page < 8; ++page) {
+        _pages.pages[0x100000 + page * kPage] = {(uint64_t{1} << 63U) | (page < 4 ? 0 : uint64_t{1} << 56U)};
+    }
+    const AddressSpace space = build(
+        "100000-108000 rw-p 00000000 00:00 0\nRss: 32 kB\nPss: 24 kB\nShared_Dirty: 16 kB\n"
+        "Private_Dirty: 16 kB\nAnonymous: 32 kB\nLazyFree: 20 kB\n");
+    ASSERT_EQ(space.regions().size(), 2U);
+    EXPECT_EQ(space.regions()[0].info.pages_dirtied, 4U) << "nobody can take what another process has";
+    EXPECT_EQ(space.regions()[1].info.pages_reusable, 4U);
+    EXPECT_EQ(space.regions()[1].info.pages_dirtied, 0U);
+}
+
 TEST_F(AddressSpaceTest, AnonymousMemoryThatWasNeverTouchedBelongsToNoObject) {
     const AddressSpaceRegion region = only("100000-200000 rw-p 00000000 00:00 0\nRss: 0 kB\nSwap: 0 kB\n");
     EXPECT_EQ(region.info.object_id_full, 0U);

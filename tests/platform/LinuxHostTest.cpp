@@ -15,6 +15,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <thread>
 
 #include "platform/MWRegionTags.h"
@@ -228,6 +229,65 @@ TEST(LinuxHost, AProcessLivesOnInItsOtherThreads) {
     waitpid(pid, nullptr, 0);
 }
 
+TEST(LinuxHost, ProcessesWithOneAddressSpaceHaveTheSameObjects) {
+    static uint64_t address = 0;
+    // The twin shares the child's memory without being a thread of it.
+    const ChildProcess child([] {
+        address = mapPages(4, MAP_PRIVATE | MAP_ANONYMOUS);
+        touch(address, {0, 1});
+        static std::array<char, 64 << 10> stack;
+        const auto pauseForEver = [](void*) -> int {
+            while (true) {
+                pause();
+            }
+        };
+        return static_cast<uint64_t>(
+            clone(pauseForEver, stack.data() + stack.size(), CLONE_VM | SIGCHLD, nullptr));
+    });
+    const auto twin = static_cast<pid_t>(child.answer());
+    MWLinuxHost host;
+    const LiveTask childTask(host, child.pid());
+    const LiveTask twinTask(host, twin);
+    const LiveTask selfTask(host, getpid());
+    const auto stackOf = [](const LiveTask& task) { return task.at(reinterpret_cast<uint64_t>(&task)); };
+    EXPECT_NE(stackOf(childTask).info.object_id_full, 0U);
+    EXPECT_EQ(stackOf(childTask).info.object_id_full, stackOf(twinTask).info.object_id_full);
+    EXPECT_NE(stackOf(childTask).info.object_id_full, stackOf(selfTask).info.object_id_full)
+        << "its parent by fork has its addresses, but another space";
+    kill(twin, SIGKILL);
+}
+
+TEST(LinuxHost, HolesAreFoundAndTheZeroPageIsNoMemory) {
+    const ChildProcess child([] {
+        constexpr size_t kPages = 64 << 10;
+        const uint64_t address = mapPages(kPages, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE);
+        madvise(reinterpret_cast<void*>(address), kPages * kPage, MADV_NOHUGEPAGE);
+        touch(address, {kPages - 1});
+        static_cast<void>(*reinterpret_cast<volatile char*>(address + 5 * kPage));  // maps the zero page
+        return address;
+    });
+    const procfs::Descriptor directory =
+        procfs::open(AT_FDCWD, ("/proc/" + std::to_string(child.pid())).c_str(), O_DIRECTORY);
+    const PageFrameFlags none{procfs::Descriptor()};
+    LivePages pages(directory.get(), {none, 0, kPage});
+    if (!pages.knowsHoles()) {
+        GTEST_SKIP() << "the kernel cannot scan";
+    }
+    const uint64_t end = child.answer() + (64 << 10) * kPage;
+    EXPECT_EQ(pages.nextPopulated(child.answer(), end), child.answer() + 5 * kPage);
+    EXPECT_EQ(pages.nextPopulated(child.answer() + 6 * kPage, end), end - kPage);
+    EXPECT_EQ(pages.nextPopulated(child.answer() + 6 * kPage, end - kPage), end - kPage);
+
+    std::vector<PagemapEntry> entries(8);
+    ASSERT_TRUE(pages.readPages(child.answer(), entries));
+    EXPECT_TRUE(entries[5].present());
+    if (entries[5].exclusive()) {
+        GTEST_SKIP() << "the kernel gives memory of its own for a read";
+    }
+    pages.clearZeroPages(child.answer(), entries);
+    EXPECT_FALSE(entries[5].present());
+}
+
 TEST(LinuxHost, ListsProcessesAndTheKernelButNoKernelThreads) {
     const ChildProcess child;
     MWLinuxHost host;
@@ -237,9 +297,10 @@ TEST(LinuxHost, ListsProcessesAndTheKernelButNoKernelThreads) {
     EXPECT_EQ(pids.front(), 0);
     EXPECT_TRUE(std::binary_search(pids.begin(), pids.end(), child.pid()));
     for (const int32_t pid : pids) {
-        std::ifstream comm("/proc/" + std::to_string(pid) + "/comm");
-        std::string name;
-        EXPECT_FALSE(std::getline(comm, name) && name == "kthreadd");
+        std::ifstream file("/proc/" + std::to_string(pid) + "/stat");
+        const std::string text{std::istreambuf_iterator<char>(file), {}};
+        const auto stat = procfs::parseStat(text);
+        EXPECT_FALSE(stat && stat->isKernelThread()) << text;
     }
     proc_bsdinfo record = {};
     EXPECT_EQ(host.proc_pidinfo(0, record), 136);

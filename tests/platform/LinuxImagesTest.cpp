@@ -138,6 +138,7 @@ TEST(LinuxImages, FilesAreToldApartByInode) {
 /// Every page is anonymous and mapped by several processes.
 class ForkedPages : public PageSource {
 public:
+    bool knowsHoles() override { return false; }
     bool readPages(uint64_t, std::span<PagemapEntry> entries) override {
         std::fill(entries.begin(), entries.end(), PagemapEntry{uint64_t{1} << 63U});
         return true;

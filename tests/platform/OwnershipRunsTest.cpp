@@ -186,15 +186,15 @@ TEST(OwnershipRuns, FramesTellGenerationsOfAFamilyApart) {
 TEST(OwnershipRuns, EachFrameOfAPageHasOneGenerationWhoeverComesFirst) {
     std::mt19937 random(11);
     FrameGenerations generations;
-    std::map<std::pair<uint32_t, uint64_t>, uint16_t> generationOf;
+    std::map<std::pair<uint32_t, uint64_t>, uint32_t> generationOf;
     for (int round = 0; round < 2000; ++round) {
         const FrameGenerations::Page page = {static_cast<uint32_t>(random() % 8), 1 + random() % 20};
-        uint16_t generation = 0;
+        uint32_t generation = 0;
         generations.assign(kBase, std::span(&page, 1), std::span(&generation, 1));
         const auto [known, isNew] = generationOf.try_emplace({page.slot, page.frame}, generation);
         ASSERT_EQ(known->second, generation);
     }
-    std::set<std::pair<uint32_t, uint16_t>> places;
+    std::set<std::pair<uint32_t, uint32_t>> places;
     for (const auto& [page, generation] : generationOf) {
         EXPECT_TRUE(places.emplace(page.first, generation).second)
             << "two frames in one place would count as one";
@@ -227,7 +227,7 @@ TEST(ForkFamily, AFamilyIsForgottenWithItsLastMember) {
     EXPECT_NE(families.family(6), first);
     const FrameGenerations::Page old = {0, 77};
     const FrameGenerations::Page now = {0, 78};
-    uint16_t generation = 9;
+    uint32_t generation = 9;
     first->generations().assign(kBase, std::span(&old, 1), std::span(&generation, 1));
     first.reset();
     families.family(5)->generations().assign(kBase, std::span(&now, 1), std::span(&generation, 1));

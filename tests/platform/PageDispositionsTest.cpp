@@ -80,6 +80,15 @@ TEST(PageDispositions, WithoutFrameFlagsTheRegionsCountsDecideInOrder) {
     EXPECT_EQ(words(pages, freed, 0x10000, {anonymous(), anonymous()}, none), (Words{kReusable, kDirty}));
 }
 
+TEST(PageDispositions, SwappedShmemLooksAbsent) {
+    const PageFrameFlags none{procfs::Descriptor()};
+    PageDispositions pages;
+    AddressSpaceRegion region = regionOf(Backing::shmem);
+    region.info.pages_swapped_out = 1;
+    EXPECT_EQ(words(pages, region, 0x10000, {absent, file(), absent}, none), (Words{kPagedOut, kDirty, 0}));
+    EXPECT_EQ(words(pages, regionOf(Backing::file), 0x10000, {absent}, none), (Words{0}));
+}
+
 TEST(PageDispositions, FrameFlagsSayWhichPagesTheyAre) {
     using F = PageFrameFlags;
     const PageFrameFlags frames =

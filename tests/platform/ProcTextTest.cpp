@@ -32,13 +32,22 @@ TEST(ProcText, StatFieldsAreCountedFromTheLastParenthesis) {
             ->isKernelThread());
 }
 
-TEST(ProcText, AProcessWhoseFirstThreadEndedIsNoZombie) {
+TEST(ProcText, AThreadThatIsEndingHasEnded) {
     auto stat = *procfs::parseStat("812 (x)" + kStatTail);
-    stat.state = 'Z';
-    EXPECT_TRUE(stat.firstThreadEnded());
-    EXPECT_FALSE(stat.isZombie());
-    stat.threads = 1;
-    EXPECT_TRUE(stat.isZombie());
+    EXPECT_FALSE(stat.threadEnded());
+    stat.flags |= 4;  // PF_EXITING: the memory may be gone while the state still says that it runs
+    EXPECT_TRUE(stat.threadEnded());
+    EXPECT_TRUE(procfs::parseStat("812 (x) Z 7 1 1 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 8812 0 0 0 0 0 0 0 0")
+                    ->threadEnded());
+}
+
+TEST(ProcText, AnotherProgramHasOtherAddresses) {
+    const auto stat = *procfs::parseStat("812 (x)" + kStatTail);
+    auto other = stat;
+    EXPECT_TRUE(stat.isSameProgramAs(other));
+    other.endCode += 1;
+    EXPECT_FALSE(stat.isSameProgramAs(other))
+        << "without address randomisation only the program's size differs";
 }
 
 TEST(ProcText, EveryCutOfAStatLineIsRefusedOrRead) {
@@ -48,6 +57,7 @@ TEST(ProcText, EveryCutOfAStatLineIsRefusedOrRead) {
         EXPECT_TRUE(!stat || stat->startTime == 8812U) << length;
     }
     EXPECT_FALSE(procfs::parseStat("x (a) S 1 1 1"));
+    EXPECT_FALSE(procfs::parseStat("1 (a)  S 1"));
     EXPECT_FALSE(procfs::parseStat(")("));
 }
 
@@ -69,6 +79,13 @@ TEST(ProcText, CommandLineNames) {
     EXPECT_EQ(procfs::nameFromCommandLine("sshd: root@pts/0\0"s), "");
     EXPECT_EQ(procfs::nameFromCommandLine("nginx worker"), "");
     EXPECT_EQ(procfs::nameFromCommandLine(""), "");
+}
+
+TEST(ProcText, Namespaces) {
+    EXPECT_EQ(procfs::parseNamespace("mnt:[4026531841]"), 4026531841U);
+    for (const char* other : {"", "mnt:", "mnt:[", "mnt:[x]", "mnt:[5", "mnt:[5]]"}) {
+        EXPECT_EQ(procfs::parseNamespace(other), 0U) << other;
+    }
 }
 
 TEST(ProcText, AuxvTellsTheWidth) {

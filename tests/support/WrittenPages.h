@@ -28,6 +28,7 @@ public:
             address += 4096;
         }
     }
+    bool knowsHoles() override { return true; }
     uint64_t nextPopulated(uint64_t address, uint64_t end) override {
         const auto found = pages.lower_bound(address);
         return found == pages.end() ? end : std::min(end, found->first);

@@ -16,28 +16,28 @@ bool startsWithAny(std::string_view text, std::initializer_list<std::string_view
                        [&](auto prefix) { return text.starts_with(prefix); });
 }
 
-uint64_t residentBytes(const Vma& vma) {
-    return vma.rss + vma.sharedHugetlb + vma.privateHugetlb;
-}
-
 // Resident bytes that cannot be dropped. An anonymous page read back from swap can be clean and still has to
 // go back to swap, so anonymous bytes count whole.
 uint64_t dirtyBytes(const BackedVma& backed) {
     const Vma& vma = backed.vma;
     if (backed.backing == Backing::shmem || backed.backing == Backing::hugetlb) {
-        return residentBytes(vma);
+        return vma.resident();
     }
     const uint64_t anonymous = vma.anonymous - std::min(vma.lazyFree, vma.anonymous);
     return std::max(vma.sharedDirty + vma.privateDirty, anonymous);
 }
 
-// Whether a private mapping of an object has pages that the process has written: these are its own.
+// Whether a private mapping of an object has pages that are the process's own. Huge pages are not counted as
+// anonymous; of theirs the counts say how many nobody else maps.
 bool hasOwnPages(const Vma& vma) {
+    if (vma.has(procfs::VmFlagHugetlb)) {
+        return !vma.shared && vma.sharedHugetlb == 0 && vma.privateHugetlb != 0;
+    }
     return !vma.shared && (vma.anonymous != 0 || vma.swap != 0);
 }
 
 bool isUntouched(const Vma& vma) {
-    return residentBytes(vma) == 0 && vma.swap == 0;
+    return vma.resident() == 0 && vma.swap == 0;
 }
 
 uint8_t shareMode(const BackedVma& backed) {
@@ -100,7 +100,7 @@ vm_region_submap_info_64 infoFor(const BackedVma& backed, uint64_t pageSize) {
     info.protection = protectionBits(vma.readable, vma.writable, vma.executable);
     info.max_protection = protectionBits(vma.has(procfs::VmFlagMayRead), vma.has(procfs::VmFlagMayWrite),
                                          vma.has(procfs::VmFlagMayExecute));
-    info.pages_resident = pageCount(residentBytes(vma), pageSize);
+    info.pages_resident = pageCount(vma.resident(), pageSize);
     info.pages_reusable = pageCount(vma.lazyFree, pageSize);
     info.pages_swapped_out = pageCount(vma.swap, pageSize);
     info.pages_dirtied = pageCount(dirtyBytes(backed), pageSize);
@@ -130,9 +130,8 @@ public:
 
     /// `image` is the one whose segment the mapping is, or null.
     void add(BackedVma backed, uint32_t tag, const LinuxImage* image) {
-        const bool isFileMapping = backed.backing == Backing::file || backed.backing == Backing::shmem;
-        if ((isFileMapping || backed.backing == Backing::anonymous) &&
-            needsOwnershipRuns(backed.vma, isFileMapping)) {
+        const bool isFileMapping = backed.backing != Backing::anonymous;
+        if (backed.backing != Backing::special && needsOwnershipRuns(backed.vma, isFileMapping)) {
             const std::vector<OwnershipRun> runs = ownershipRuns(
                 {.vma = backed.vma, .isFileMapping = isFileMapping, .pageSize = _context.pageSize}, _pages,
                 _family().generations());
@@ -193,23 +192,19 @@ private:
         _regions.push_back(std::move(region));
     }
 
-    // Lazily freed pages are the process's own as a rule (the kernel frees no others), dirty file pages the
-    // file's; how many of them lie in which run is not known, the first runs are taken.
+    // Lazily freed pages that are still shared count as dirty: they cannot be taken while another process has
+    // them. How many of a mapping's lazily freed pages and of its dirty file pages lie in which run is not
+    // known; the first runs are taken.
     void _addRuns(const BackedVma& backed, const Use& use, const std::vector<OwnershipRun>& runs) {
         uint64_t lazilyFreed = backed.vma.lazyFree / _context.pageSize;
         uint64_t dirtyFile = dirtyFileBytes(backed.vma) / _context.pageSize;
-        const size_t first = _regions.size();
         for (const OwnershipRun& run : runs) {
             _regions.push_back(_regionOfRun(backed, use, run));
-        }
-        for (const PageOwner owner : {PageOwner::process, PageOwner::family, PageOwner::object}) {
-            for (size_t i = 0; i < runs.size(); ++i) {
-                if (runs[i].owner == owner) {
-                    const uint64_t reusable = isWritten(owner) ? takeUpTo(lazilyFreed, runs[i].resident) : 0;
-                    const uint64_t dirty = isWritten(owner) ? 0 : takeUpTo(dirtyFile, runs[i].resident);
-                    _count(_regions[first + i], runs[i], {.reusable = reusable, .dirtyFile = dirty});
-                }
-            }
+            const bool isOwn = run.owner == PageOwner::process;
+            const bool isObject = run.owner == PageOwner::object;
+            _count(_regions.back(), run,
+                   {.reusable = isOwn ? takeUpTo(lazilyFreed, run.resident) : 0,
+                    .dirtyFile = isObject ? takeUpTo(dirtyFile, run.resident) : 0});
         }
     }
 
@@ -232,7 +227,7 @@ private:
         uint64_t dirtyFile;
     };
     void _count(AddressSpaceRegion& region, const OwnershipRun& run, PageKinds kinds) const {
-        const bool onlySwapTakes = isWritten(run.owner) || region.backing == Backing::shmem;
+        const bool onlySwapTakes = isWritten(run.owner) || region.backing != Backing::file;
         region.info.pages_resident = static_cast<uint32_t>(run.resident);
         region.info.pages_swapped_out = static_cast<uint32_t>(run.swapped);
         region.info.pages_reusable = static_cast<uint32_t>(kinds.reusable);
@@ -314,6 +309,10 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
     const std::string_view path = vma.path;
     if (vma.has(procfs::VmFlagHugetlb)) {
         return Backing::hugetlb;
+    }
+    // Memory of a device, wherever its node lies: /dev can be a tmpfs.
+    if (vma.has(procfs::VmFlagIo) || vma.has(procfs::VmFlagPfnMap)) {
+        return Backing::special;
     }
     if (path.empty() || startsWithAny(path, {"[heap]", "[stack", "[anon:"}) ||
         (path == "/dev/zero" && !vma.shared)) {

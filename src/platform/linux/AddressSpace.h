@@ -44,6 +44,12 @@ struct AddressSpaceRegion {
     uint64_t lazilyFreedBytes = 0;  ///< given up with MADV_FREE and not yet taken
 
     uint64_t end() const { return start + size; }
+    /// Holes are worth asking the kernel for.
+    bool isSparse(uint64_t pageSize) const {
+        constexpr uint64_t kSparse = 8;
+        const uint64_t pages = uint64_t{info.pages_resident} + info.pages_swapped_out;
+        return pages * pageSize < size / kSparse;
+    }
 };
 
 /// One consistent look at a process's mappings, turned into regions: ascending, without overlap, none empty.

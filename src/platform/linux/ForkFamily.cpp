@@ -1,10 +1,10 @@
 #include "platform/linux/ForkFamily.h"
 
-#include <sys/personality.h>
 #include <sys/uio.h>
 
 #include <elf.h>
 #include <array>
+#include <bit>
 #include <cstring>
 #include <numeric>
 #include <string>
@@ -40,18 +40,11 @@ std::optional<RandomBytes> readRandomBytes(int32_t pid, std::string_view auxv) {
     return read ? std::optional(bytes) : std::nullopt;
 }
 
-bool hasRandomAddresses(int procDirectory, int processDirectory) {
-    std::string text;
-    if (procfs::readFile(procDirectory, "sys/kernel/randomize_va_space", text) && text.starts_with('0')) {
-        return false;
-    }
-    uint64_t personality = ADDR_NO_RANDOMIZE;
-    if (procfs::readFile(processDirectory, "personality", text)) {
-        constexpr int kHex = 16;
-        std::string_view digits = text;
-        procfs::takeNumber(digits, personality, kHex);
-    }
-    return (personality & ADDR_NO_RANDOMIZE) == 0;
+// The random bytes lie on the stack, which without address randomisation ends at the end of the address
+// space.
+bool hasRandomAddresses(uint64_t stackAddress) {
+    constexpr uint64_t kLargestArguments = 16U << 20U;
+    return !std::has_single_bit((stackAddress | (kLargestArguments - 1)) + 1);
 }
 
 // The oldest process of the chain of parents, beginning with `pid`, that runs the same executable.
@@ -93,7 +86,8 @@ uint64_t forkFamilyIdentifier(int procDirectory, int processDirectory, int32_t p
     if (const auto bytes = readRandomBytes(pid, auxv)) {
         return identity.bytes({bytes->data(), bytes->size()});
     }
-    if (!auxv.empty() && hasRandomAddresses(procDirectory, processDirectory)) {
+    const std::optional<uint64_t> stackAddress = randomBytesAddress(auxv);
+    if (stackAddress && hasRandomAddresses(*stackAddress)) {
         return identity.bytes(auxv);
     }
     return oldestOfChain(procDirectory, pid, identity);

@@ -13,7 +13,7 @@ uint32_t folded(uint64_t frame) {
 
 }  // namespace
 
-void FrameGenerations::assign(uint64_t window, std::span<const Page> pages, std::span<uint16_t> generations) {
+void FrameGenerations::assign(uint64_t window, std::span<const Page> pages, std::span<uint32_t> generations) {
     const std::lock_guard lock(_mutex);
     Window& table = _windows[window];
     std::transform(pages.begin(), pages.end(), generations.begin(),
@@ -25,7 +25,7 @@ uint64_t FrameGenerations::pages() const {
     return _pages;
 }
 
-uint16_t FrameGenerations::_assign(Window& window, const Page& page) {
+uint32_t FrameGenerations::_assign(Window& window, const Page& page) {
     const uint32_t frame = folded(page.frame);
     for (size_t generation = 0; generation < window.size(); ++generation) {
         uint32_t& slot = (*window[generation])[page.slot];
@@ -34,11 +34,11 @@ uint16_t FrameGenerations::_assign(Window& window, const Page& page) {
             ++_pages;
         }
         if (slot == frame) {
-            return static_cast<uint16_t>(generation);
+            return static_cast<uint32_t>(generation);
         }
     }
     window.push_back(std::make_unique<Generation>());
     (*window.back())[page.slot] = frame;
     ++_pages;
-    return static_cast<uint16_t>(window.size() - 1);
+    return static_cast<uint32_t>(window.size() - 1);
 }

@@ -33,7 +33,7 @@ public:
     };
 
     /// The generation of each page; all of them lie in the window at `window`, an address.
-    void assign(uint64_t window, std::span<const Page> pages, std::span<uint16_t> generations);
+    void assign(uint64_t window, std::span<const Page> pages, std::span<uint32_t> generations);
 
     /// The pages that have been told apart so far.
     uint64_t pages() const;
@@ -44,7 +44,7 @@ private:
     using Generation = std::array<uint32_t, kSlots>;
     using Window = std::vector<std::unique_ptr<Generation>>;
 
-    uint16_t _assign(Window& window, const Page& page);
+    uint32_t _assign(Window& window, const Page& page);
 
     mutable std::mutex _mutex;
     uint64_t _pages = 0;

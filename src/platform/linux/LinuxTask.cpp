@@ -46,7 +46,7 @@ LiveThread openLiveThread(int processDirectory) {
     while (const dirent* entry = readdir(threads)) {
         procfs::Descriptor thread = openDirectory(dirfd(threads), entry->d_name);
         const auto stat = entry->d_name[0] == '.' || !thread ? std::nullopt : readStat(thread.get());
-        if (stat && !stat->firstThreadEnded()) {
+        if (stat && !stat->threadEnded()) {
             found = {stat->pid, std::move(thread)};
             break;
         }
@@ -61,18 +61,6 @@ bool mayLook(int memoryDirectory) {
     return static_cast<bool>(procfs::open(memoryDirectory, "maps")) || errno == ESRCH;
 }
 
-// The link reads "ipc:[NUMBER]".
-uint64_t ipcNamespace(int processDirectory) {
-    std::string target;
-    uint64_t number = 0;
-    if (procfs::readLink(processDirectory, "ns/ipc", target)) {
-        std::string_view text = target;
-        procfs::takePrefix(text, "ipc:[");
-        procfs::takeNumber(text, number);
-    }
-    return number;
-}
-
 }  // namespace
 
 LinuxRun::LinuxRun(const std::string& procDirectory)
@@ -80,28 +68,39 @@ LinuxRun::LinuxRun(const std::string& procDirectory)
       pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
       identity(bootId(proc.get())),
       frames(procfs::open(proc.get(), "kpageflags")),
-      zeroFrame(findZeroFrame(proc.get(), pageSize)) {}
+      untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)) {}
 
 LinuxTask::LinuxTask(LinuxRun& run, int32_t pid)
     : _run(run), _pid(pid), _directory(openDirectory(run.proc.get(), std::to_string(pid))), _threadId(pid) {}
 
+bool hasLiveThread(int processDirectory) {
+    return static_cast<bool>(openLiveThread(processDirectory).directory);
+}
+
 std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
     std::unique_ptr<LinuxTask> task(new LinuxTask(run, pid));
-    const auto stat = task->_directory ? task->_readStat() : std::nullopt;
+    const auto stat = task->_directory ? readStat(task->directory()) : std::nullopt;
     if (!stat) {
         return nullptr;
     }
     task->_startTime = stat->startTime;
-    if (stat->firstThreadEnded() && !stat->isZombie()) {
-        LiveThread thread = openLiveThread(task->directory());
-        task->_threadId = thread.directory ? thread.identifier : pid;
-        task->_thread = std::move(thread.directory);
-    }
+    task->_chooseThread();
     return mayLook(task->_memoryDirectory()) ? std::move(task) : nullptr;
 }
 
-std::optional<procfs::ProcStat> LinuxTask::_readStat() const {
-    return readStat(directory());
+LinuxTask::~LinuxTask() {
+    _run.sharedSpaces.forget({_pid, _startTime});
+}
+
+bool LinuxTask::_chooseThread() {
+    const auto chosen = readStat(_memoryDirectory());
+    if (chosen && !chosen->threadEnded()) {
+        return true;
+    }
+    LiveThread thread = openLiveThread(directory());
+    _threadId = thread.directory ? thread.identifier : _pid;
+    _thread = std::move(thread.directory);
+    return static_cast<bool>(_thread);
 }
 
 // The text of a large process is tens of megabytes, so it is parsed as it comes. The kernel hands out a page
@@ -124,26 +123,26 @@ bool LinuxTask::_parseSmaps(std::vector<procfs::Vma>& vmas) const {
     return count == 0;
 }
 
-// A text that the process's end or its exec cuts short ends like any other, so the process is looked at
-// before and after: one that executes another program meanwhile is read again.
-kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) const {
-    constexpr int kAttempts = 3;
-    auto before = _readStat();
+// A text that a thread's end or its exec cuts short ends like any other, so the thread is looked at before
+// and after: when it has ended another one is asked, when it runs another program the text is read again.
+kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) {
+    constexpr int kAttempts = 5;
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
+        if (!_chooseThread()) {
+            return MACH_SEND_INVALID_DEST;
+        }
+        const auto before = readStat(_memoryDirectory());
         const bool read = _parseSmaps(vmas);
         if (!read && errno != ESRCH) {
             return KERN_FAILURE;
         }
-        const auto after = _readStat();
-        if (!before || !after || after->isZombie()) {
-            return MACH_SEND_INVALID_DEST;
-        }
-        startStack = after->startStack;
-        if (std::exchange(before, after)->startStack == startStack) {
-            break;
+        const auto after = readStat(_memoryDirectory());
+        if (read && before && after && !after->threadEnded() && after->isSameProgramAs(*before)) {
+            startStack = after->startStack;
+            return vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
         }
     }
-    return vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
+    return MACH_SEND_INVALID_DEST;
 }
 
 ForkFamily& LinuxTask::_family() {
@@ -164,12 +163,13 @@ kern_return_t LinuxTask::takeSnapshot() {
     if (code != KERN_SUCCESS) {
         return code;
     }
-    _pages.emplace(_memoryDirectory(), PageFacts{_run.frames, _run.zeroFrame, _run.pageSize});
-    const ProcessIdentity owner = _run.sharedSpaces.ownerOf({{_pid, _startTime}, _threadId, startStack});
+    _pages.emplace(_memoryDirectory(),
+                   PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
+    const ProcessIdentity owner = _run.sharedSpaces.ownerOf(_candidate(startStack));
     _space.emplace(std::move(vmas),
                    AddressSpaceOwner{.pid = owner.pid,
                                      .startTime = owner.startTime,
-                                     .ipcNamespace = ipcNamespace(_memoryDirectory()),
+                                     .ipcNamespace = procfs::readNamespace(_memoryDirectory(), "ipc"),
                                      .directory = _memoryDirectory(),
                                      .family = [this]() -> ForkFamily& { return _family(); }},
                    *_pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
@@ -183,7 +183,7 @@ kern_return_t LinuxTask::takeSnapshot() {
 // the ones that its parent still shares. The members' parts do add up to all of them.
 void LinuxTask::_checkFamilyMemory() {
     const uint64_t part = _space->partOfFamilyMemory();
-    if (part == 0 || _run.zeroFrame != 0) {
+    if (part == 0 || _run.seesFrames()) {
         return;
     }
     ForkFamily& family = _family();
@@ -201,6 +201,28 @@ void LinuxTask::dropSnapshot() {
     _space.reset();
     _pages.reset();
     _entries = {};
+    _holeStart = _holeEnd = 0;
+}
+
+// The pages from `address` on, as many as there are entries, all of them in the region. A file of a terabyte
+// of which three pages are mapped is asked about only where it has some.
+bool LinuxTask::_readEntries(const AddressSpaceRegion& region, uint64_t address) {
+    const uint64_t end = address + _entries.size() * _run.pageSize;
+    if (region.isSparse(_run.pageSize) && (address < _holeStart || address >= _holeEnd)) {
+        _holeStart = address;
+        _holeEnd = _pages->nextPopulated(address, region.end());
+    }
+    if (address >= _holeStart && end <= _holeEnd) {
+        std::fill(_entries.begin(), _entries.end(), PagemapEntry{});
+        return true;
+    }
+    if (!_pages->readPages(address, _entries)) {
+        return false;
+    }
+    if (region.backing == Backing::anonymous) {
+        _pages->clearZeroPages(address, _entries);
+    }
+    return true;
 }
 
 kern_return_t LinuxTask::fillDispositions(uint64_t start, std::span<int32_t> words) {
@@ -211,11 +233,8 @@ kern_return_t LinuxTask::fillDispositions(uint64_t start, std::span<int32_t> wor
     for (; region != nullptr && region != last && region->start < end; ++region) {
         const uint64_t from = std::max(start, region->start);
         _entries.resize((std::min(end, region->end()) - from) / _run.pageSize);
-        if (!_pages->readPages(from, _entries)) {
+        if (!_readEntries(*region, from)) {
             return KERN_INVALID_ARGUMENT;
-        }
-        if (region->backing == Backing::anonymous) {
-            _pages->clearZeroPages(from, _entries);
         }
         _dispositions.fill(*region, from, _entries, _run.frames, _run.pageSize,
                            words.subspan((from - start) / _run.pageSize));

@@ -28,8 +28,13 @@ struct LinuxRun {
     ForkFamilies families;
     SharedAddressSpaces sharedSpaces;
     PageFrameFlags frames;
-    uint64_t zeroFrame;
+    PagemapEntry untouchedPage;  ///< of this process, to know the zero page by
+
+    bool seesFrames() const { return untouchedPage.frame() != 0; }
 };
+
+/// Whether a thread of the process lives, be it the first one or another.
+bool hasLiveThread(int processDirectory);
 
 /// What a task handle stands for: one process, held by its open directory, and during a walk the snapshot of
 /// its address space. Used by one thread at a time.
@@ -38,6 +43,9 @@ public:
     /// None when there is no such process or the caller may not look at its memory. A process that has ended
     /// but is still there can be opened: its address space is then gone. `run` outlives the task.
     static std::unique_ptr<LinuxTask> open(LinuxRun& run, int32_t pid);
+    ~LinuxTask();
+    LinuxTask(const LinuxTask&) = delete;
+    LinuxTask& operator=(const LinuxTask&) = delete;
 
     int32_t pid() const { return _pid; }
     /// /proc/PID, opened with O_PATH.
@@ -60,11 +68,16 @@ public:
 private:
     LinuxTask(LinuxRun& run, int32_t pid);
 
-    std::optional<procfs::ProcStat> _readStat() const;
-    /// The directory to read memory through: a process whose first thread has ended shows nothing there.
+    /// The directory to read memory through: that of a thread that lives.
     int _memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
+    /// False when no thread of the process lives.
+    bool _chooseThread();
     bool _parseSmaps(std::vector<procfs::Vma>& vmas) const;
-    kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) const;
+    kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack);
+    bool _readEntries(const AddressSpaceRegion& region, uint64_t address);
+    SharedAddressSpaces::Candidate _candidate(uint64_t startStack) const {
+        return {{_pid, _startTime}, _threadId, startStack};
+    }
     ForkFamily& _family();
     void _checkFamilyMemory();
 
@@ -80,4 +93,6 @@ private:
     std::optional<AddressSpace> _space;
     PageDispositions _dispositions;
     std::vector<PagemapEntry> _entries;
+    uint64_t _holeStart = 0;  ///< pages that are known to be absent
+    uint64_t _holeEnd = 0;
 };

@@ -61,18 +61,22 @@ int scanPages(int pagemap, const Scan& scan, std::span<PageRegion> regions, uint
 
 }  // namespace
 
-uint64_t findZeroFrame(int procDirectory, uint64_t pageSize) {
+PagemapEntry lookAtUntouchedPage(int procDirectory, uint64_t pageSize) {
     void* page = mmap(nullptr, pageSize, PROT_READ, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
     if (page == MAP_FAILED) {
-        return 0;
+        return {};
     }
-    static_cast<void>(*static_cast<volatile char*>(page));  // maps the zero page
+    static_cast<void>(*static_cast<volatile char*>(page));
     const procfs::Descriptor pagemap = procfs::open(procDirectory, "self/pagemap");
     PagemapEntry entry;
     const auto offset = static_cast<off_t>(reinterpret_cast<uint64_t>(page) / pageSize * sizeof(entry));
     const bool read = pread(pagemap.get(), &entry, sizeof(entry), offset) == sizeof(entry);
     munmap(page, pageSize);
-    return read && entry.present() && !entry.exclusive() ? entry.frame() : 0;
+    return read ? entry : PagemapEntry{};
+}
+
+uint64_t zeroFrameOf(PagemapEntry untouched) {
+    return untouched.present() && !untouched.exclusive() ? untouched.frame() : 0;
 }
 
 int LivePages::_file() {
@@ -131,6 +135,12 @@ void LivePages::_clearByFlags(std::span<PagemapEntry> entries) const {
             entry = {};
         }
     }
+}
+
+bool LivePages::knowsHoles() {
+    std::array<PageRegion, 1> found = {};
+    uint64_t walkEnd = 0;
+    return scanPages(_file(), {0, _facts.pageSize, kIsPresent}, found, walkEnd) >= 0;
 }
 
 uint64_t LivePages::nextPopulated(uint64_t address, uint64_t end) {

@@ -10,12 +10,15 @@
 /// What the kernel tells everybody's pages by, found out once for a run.
 struct PageFacts {
     const PageFrameFlags& frames;
-    uint64_t zeroFrame;  ///< the frame of the zero page; 0 where frame numbers are hidden
+    uint64_t zeroFrame;  ///< of the zero page; 0 where it is not known
     uint64_t pageSize;
 };
 
-/// The frame that reading untouched anonymous memory maps, looked up in this process's own `pagemap`.
-uint64_t findZeroFrame(int procDirectory, uint64_t pageSize);
+/// What this process's own `pagemap` says of memory that was only read: as a rule the zero page. Its frame
+/// reads as 0 where frame numbers are hidden.
+PagemapEntry lookAtUntouchedPage(int procDirectory, uint64_t pageSize);
+/// The frame of the zero page as `untouched` tells it, or 0: some kernels map memory of its own at once.
+uint64_t zeroFrameOf(PagemapEntry untouched);
 
 /// The pages of a live process, read from its `pagemap`.
 class LivePages : public PageSource {
@@ -27,6 +30,7 @@ public:
     bool readPages(uint64_t address, std::span<PagemapEntry> entries) override;
     void clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) override;
     uint64_t nextPopulated(uint64_t address, uint64_t end) override;
+    bool knowsHoles() override;
 
 private:
     int _file();

@@ -67,7 +67,7 @@ LinuxTask* MWLinuxHost::_task(task_t task) {
 kern_return_t MWLinuxHost::task_read_for_pid(int32_t pid, task_t& task) {
     std::unique_ptr<LinuxTask> opened = LinuxTask::open(_run, pid);
     if (opened == nullptr) {
-        return KERN_FAILURE;
+        return errno == EMFILE || errno == ENFILE ? KERN_RESOURCE_SHORTAGE : KERN_FAILURE;
     }
     const std::lock_guard lock(_tasksMutex);
     do {
@@ -157,7 +157,7 @@ kern_return_t MWLinuxHost::mach_vm_page_range_query(task_t task, uint64_t start,
     }
     const kern_return_t code = record->takeSnapshot();
     if (code != KERN_SUCCESS) {
-        return code;
+        return code == MACH_SEND_INVALID_DEST ? KERN_INVALID_ARGUMENT : code;
     }
     count = std::min<uint64_t>(length / _run.pageSize, dispositions.size());
     return record->fillDispositions(start, dispositions.first(count));
@@ -229,6 +229,8 @@ std::string MWLinuxHost::mach_error_string(kern_return_t code) {
             return "(os/kern) invalid argument";
         case KERN_FAILURE:
             return "(os/kern) failure";
+        case KERN_RESOURCE_SHORTAGE:
+            return "too many open files";
         case MACH_SEND_INVALID_DEST:
             return "the address space is gone";
         default:

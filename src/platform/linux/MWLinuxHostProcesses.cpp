@@ -27,6 +27,11 @@ int noSuchProcess() {
     return -1;
 }
 
+// A process lives as long as one of its threads does; the first one can end before the others.
+uint32_t statusOf(const procfs::ProcStat& stat, int directory) {
+    return stat.threadEnded() && !hasLiveThread(directory) ? SZOMB : kRunning;
+}
+
 // The kernel itself, as pid 0.
 proc_bsdinfo kernelRecord() {
     proc_bsdinfo record = {};
@@ -120,7 +125,8 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) {
     record = {};
     record.pbsi_pid = static_cast<uint32_t>(pid);
     record.pbsi_ppid = static_cast<uint32_t>(stat->ppid);
-    record.pbsi_status = stat->isZombie() ? SZOMB : kRunning;
+    procfs::Descriptor opened;
+    record.pbsi_status = statusOf(*stat, _processDirectory(pid, opened));
     copyText(record.pbsi_comm, stat->comm);
     return sizeof(record);
 }
@@ -141,7 +147,7 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     record = {};
     record.pbi_pid = static_cast<uint32_t>(pid);
     record.pbi_ppid = static_cast<uint32_t>(stat->ppid);
-    record.pbi_status = stat->isZombie() ? SZOMB : kRunning;
+    record.pbi_status = statusOf(*stat, directory);
     copyText(record.pbi_comm, stat->comm);
     procfs::readFile(directory, "cmdline", text);
     copyText(record.pbi_name, procfs::nameFromCommandLine(text));

@@ -11,7 +11,7 @@ constexpr uint64_t kMostRuns = 1024;
 /// Owner and generation of one page.
 struct Ownership {
     PageOwner owner = PageOwner::none;
-    uint16_t generation = 0;
+    uint32_t generation = 0;
 
     bool operator==(const Ownership&) const = default;
     auto operator<=>(const Ownership&) const = default;
@@ -61,7 +61,7 @@ public:
         if (std::none_of(_runs.begin(), _runs.end(), hasOwner)) {
             return {};
         }
-        _reconcile(&OwnershipRun::resident, _question.vma.rss / _question.pageSize);
+        _reconcile(&OwnershipRun::resident, _question.vma.resident() / _question.pageSize);
         _reconcile(&OwnershipRun::swapped, _question.vma.swap / _question.pageSize);
         return std::move(_runs);
     }
@@ -202,7 +202,7 @@ private:
     std::vector<Ownership> _ownerships;
     std::vector<FrameGenerations::Page> _framePages;
     std::vector<size_t> _framePositions;
-    std::vector<uint16_t> _frameGenerations;
+    std::vector<uint32_t> _frameGenerations;
 };
 
 }  // namespace
@@ -212,6 +212,9 @@ private:
 bool needsOwnershipRuns(const procfs::Vma& vma, bool isFileMapping) {
     if (vma.shared || vma.ksm != 0) {
         return false;
+    }
+    if (vma.has(procfs::VmFlagHugetlb)) {
+        return vma.sharedHugetlb != 0 && vma.privateHugetlb != 0;
     }
     const bool written = vma.anonymous != 0 || vma.swap != 0;
     const bool sharesPages = vma.sharedClean + vma.sharedDirty != 0;
@@ -231,7 +234,7 @@ public:
           _pageSize(question.pageSize),
           _pages(pages),
           _withoutZeroPages(withoutZeroPages),
-          _isSparse((question.vma.rss + question.vma.swap) * kSparse < question.vma.size()) {}
+          _isSparse((question.vma.resident() + question.vma.swap) * kSparse < question.vma.size()) {}
 
     /// The end of the stretch that begins at `start` and has no pages at all; `start` when there is none.
     uint64_t endOfNothing(uint64_t start) {
@@ -304,13 +307,17 @@ bool addWindows(RunMaker& maker, WindowReader& reader, const procfs::Vma& vma) {
 // some shows by more pages being present than the mapping's count has.
 std::vector<OwnershipRun> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
                                         FrameGenerations& generations) {
+    constexpr uint64_t kLargestWithoutKnowingHoles = 64ULL << 30U;
+    if (question.vma.size() > kLargestWithoutKnowingHoles && !pages.knowsHoles()) {
+        return {};
+    }
     for (const bool withoutZeroPages : {false, true}) {
         RunMaker maker(question, generations);
         WindowReader reader(question, pages, withoutZeroPages);
         if (!addWindows(maker, reader, question.vma)) {
             return {};
         }
-        if (withoutZeroPages || maker.resident() <= question.vma.rss / question.pageSize) {
+        if (withoutZeroPages || maker.resident() <= question.vma.resident() / question.pageSize) {
             return maker.finish();
         }
     }

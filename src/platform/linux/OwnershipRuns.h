@@ -19,6 +19,8 @@ public:
     /// The first page in [address, end) that is present or swapped, or `end`; `address` itself where the
     /// kernel cannot say.
     virtual uint64_t nextPopulated(uint64_t address, uint64_t end) = 0;
+    /// Whether `nextPopulated` can say.
+    virtual bool knowsHoles() = 0;
 };
 
 /// To whom a page of a private mapping belongs.
@@ -34,7 +36,7 @@ struct OwnershipRun {
     uint64_t start = 0;
     uint64_t end = 0;
     PageOwner owner = PageOwner::none;
-    uint16_t generation = 0;  ///< of the family's frames, see FrameGenerations
+    uint32_t generation = 0;  ///< of the family's frames, see FrameGenerations
     uint64_t resident = 0;
     uint64_t swapped = 0;
     bool grouped = false;  ///< the addresses stand for the pages without being theirs
@@ -65,6 +67,6 @@ bool needsOwnershipRuns(const procfs::Vma& vma, bool isFileMapping);
 ///
 /// The counts of the runs add up to those of the mapping (`rss`, `swap`), which was counted a moment earlier:
 /// what came or went in between is added to or taken from the largest runs. Empty when the pages cannot be
-/// read or are all gone.
+/// read, are all gone, or lie in a mapping so large that it cannot be read without knowing its holes.
 std::vector<OwnershipRun> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
                                         FrameGenerations& generations);

@@ -19,6 +19,8 @@ void PageDispositions::fill(const AddressSpaceRegion& region, uint64_t address,
     if (address != _next || address == region.start) {
         _dirtyFileBytesLeft = region.dirtyFileBytes;
         _lazilyFreedBytesLeft = region.lazilyFreedBytes;
+        _swappedShmemBytesLeft =
+            region.backing == Backing::shmem ? region.info.pages_swapped_out * pageSize : 0;
     }
     for (size_t page = 0; page < entries.size(); ++page) {
         words[page] = _word(region, entries[page], frames, pageSize);
@@ -32,12 +34,14 @@ int32_t PageDispositions::_word(const AddressSpaceRegion& region, PagemapEntry e
         return VM_PAGE_QUERY_PAGE_PAGED_OUT;
     }
     if (!entry.present()) {
-        return 0;
+        return takePage(_swappedShmemBytesLeft, pageSize) ? VM_PAGE_QUERY_PAGE_PAGED_OUT : 0;
     }
     const bool isFilePage = region.backing == Backing::file && entry.fileOrShared();
     const bool flagsNeeded = isFilePage ? region.dirtyFileBytes != 0 : region.lazilyFreedBytes != 0;
-    const bool flagsKnown = flagsNeeded && frames.readable() && entry.frame() != 0;
-    const uint64_t flags = flagsKnown ? frames.flagsOfFrame(entry.frame()) : 0;
+    const bool frameKnown = flagsNeeded && frames.readable() && entry.frame() != 0;
+    const uint64_t flags = frameKnown ? frames.flagsOfFrame(entry.frame()) : 0;
+    // Before Linux 6.10 the tail of a large page had not the flags of the page.
+    const bool flagsKnown = frameKnown && (flags & PageFrameFlags::kCompoundTail) == 0;
     if (isFilePage) {
         const bool dirty = _isDirtyFilePage(flags, flagsKnown, pageSize);
         return VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL |
@@ -51,12 +55,12 @@ int32_t PageDispositions::_word(const AddressSpaceRegion& region, PagemapEntry e
 }
 
 bool PageDispositions::_isDirtyFilePage(uint64_t flags, bool flagsKnown, uint64_t pageSize) {
-    return flagsKnown ? (flags & PageFrameFlags::kDirty) != 0 : takePage(_dirtyFileBytesLeft, pageSize);
+    const bool mayBe = !flagsKnown || (flags & PageFrameFlags::kDirty) != 0;
+    return mayBe && takePage(_dirtyFileBytesLeft, pageSize);
 }
 
 bool PageDispositions::_isLazilyFreed(uint64_t flags, bool flagsKnown, uint64_t pageSize) {
-    if (!flagsKnown) {
-        return takePage(_lazilyFreedBytesLeft, pageSize);
-    }
-    return (flags & PageFrameFlags::kAnonymous) != 0 && (flags & PageFrameFlags::kSwapBacked) == 0;
+    const bool mayBe = !flagsKnown || ((flags & PageFrameFlags::kAnonymous) != 0 &&
+                                       (flags & PageFrameFlags::kSwapBacked) == 0);
+    return mayBe && takePage(_lazilyFreedBytesLeft, pageSize);
 }

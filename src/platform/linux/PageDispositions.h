@@ -11,7 +11,9 @@
 ///
 /// Which file pages are dirty and which anonymous pages are lazily freed only `kpageflags` tells. Without it
 /// the region's own counts say how many there are, and the first ones in address order are taken for them:
-/// the sums are then right, the places a guess.
+/// the sums are then right, the places a guess. Never more pages of a kind are handed out than the counts say
+/// (a page written again after MADV_FREE looks freed to `kpageflags`). So it goes for swapped pages of shmem,
+/// which `pagemap` shows as absent.
 class PageDispositions {
 public:
     PageDispositions() = default;
@@ -30,4 +32,5 @@ private:
     uint64_t _next = UINT64_MAX;       ///< address behind the last page asked for
     uint64_t _dirtyFileBytesLeft = 0;  ///< of the region's counts, not handed out yet
     uint64_t _lazilyFreedBytesLeft = 0;
+    uint64_t _swappedShmemBytesLeft = 0;
 };

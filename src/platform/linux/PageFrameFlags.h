@@ -17,6 +17,7 @@ public:
     static constexpr uint64_t kDirty = uint64_t{1} << 4U;
     static constexpr uint64_t kAnonymous = uint64_t{1} << 12U;
     static constexpr uint64_t kSwapBacked = uint64_t{1} << 14U;
+    static constexpr uint64_t kCompoundTail = uint64_t{1} << 16U;
     static constexpr uint64_t kZeroPage = uint64_t{1} << 24U;
 
 private:

@@ -1,5 +1,6 @@
 #include "platform/linux/ProcText.h"
 
+#include <algorithm>
 #include <array>
 #include <cstring>
 #include <utility>
@@ -49,13 +50,16 @@ std::optional<ProcStat> parseStat(std::string_view text) {
     }
     stat.comm = text.substr(nameStart, close - nameStart);
     std::string_view rest = text.substr(close + 2);
-    stat.state = takeWord(rest).front();
-    if (!takeField(rest, stat.ppid)) {
+    const std::string_view state = takeWord(rest);
+    if (state.empty() || !takeField(rest, stat.ppid)) {
         return std::nullopt;
     }
-    // The words passed over before flags (9), num_threads (20), starttime (22) and startstack (28).
-    constexpr std::array<int, 4> kSkippedBefore = {4, 10, 1, 5};
-    const std::array<uint64_t*, 4> fields = {&stat.flags, &stat.threads, &stat.startTime, &stat.startStack};
+    stat.state = state.front();
+    // The words passed over before flags (9), num_threads (20), starttime (22), startcode (26), endcode (27)
+    // and startstack (28).
+    constexpr std::array<int, 6> kSkippedBefore = {4, 10, 1, 3, 0, 0};
+    const std::array<uint64_t*, 6> fields = {&stat.flags,     &stat.threads, &stat.startTime,
+                                             &stat.startCode, &stat.endCode, &stat.startStack};
     for (size_t i = 0; i < fields.size(); ++i) {
         for (int skipped = 0; skipped < kSkippedBefore[i]; ++skipped) {
             takeWord(rest);
@@ -94,6 +98,12 @@ std::string nameFromCommandLine(std::string_view commandLine) {
         return {};
     }
     return std::string(program.substr(program.rfind('/') + 1));
+}
+
+uint64_t parseNamespace(std::string_view link) {
+    uint64_t number = 0;
+    link.remove_prefix(std::min(link.find('['), link.size()));
+    return takePrefix(link, "[") && takeNumber(link, number) && link == "]" ? number : 0;
 }
 
 // Entries are pairs of type and value; the first type is a small number, so in the 32-bit form the upper half

@@ -16,13 +16,20 @@ struct ProcStat {
     int32_t ppid = 0;
     uint64_t flags = 0;
     uint64_t threads = 0;
-    uint64_t startTime = 0;   ///< clock ticks since boot
-    uint64_t startStack = 0;  ///< changes with exec; 0 where the caller may not look
+    uint64_t startTime = 0;  ///< clock ticks since boot
+    // Addresses of the program; 0 where the caller may not look, and once the memory is gone.
+    uint64_t startCode = 0;
+    uint64_t endCode = 0;
+    uint64_t startStack = 0;
 
     bool isKernelThread() const { return (flags & 0x00200000U) != 0; }
-    /// A first thread that has ended looks like a zombie while the process lives on in its other threads.
-    bool firstThreadEnded() const { return state == 'Z' || state == 'X'; }
-    bool isZombie() const { return firstThreadEnded() && threads <= 1; }
+    /// The thread that this was read of has ended, or is ending and may have no memory any more (PF_EXITING).
+    /// The process can live on in other threads.
+    bool threadEnded() const { return state == 'Z' || state == 'X' || (flags & 0x4U) != 0; }
+    /// Whether two looks at one thread saw the same program.
+    bool isSameProgramAs(const ProcStat& other) const {
+        return startCode == other.startCode && endCode == other.endCode && startStack == other.startStack;
+    }
 };
 
 /// What `status` tells of a process, in bytes. Exact from about Linux 6.16 (and 6.12 stable), before that off
@@ -44,6 +51,9 @@ ProcStatus parseStatus(std::string_view text);
 std::string nameFromCommandLine(std::string_view commandLine);
 /// Whether the text of `auxv` has 64-bit entries; none when it is too short to tell.
 std::optional<bool> auxvIs64bit(std::string_view auxv);
+
+/// The number in "ipc:[NUMBER]", what the link of a namespace reads; 0 for any other text.
+uint64_t parseNamespace(std::string_view link);
 
 /// Takes a number off the front of `text`; false and nothing taken when there is none or it does not fit.
 template <class Number>

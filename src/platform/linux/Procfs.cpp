@@ -8,6 +8,8 @@
 #include <cerrno>
 #include <utility>
 
+#include "platform/linux/ProcText.h"
+
 namespace procfs {
 
 Descriptor& Descriptor::operator=(Descriptor&& other) noexcept {
@@ -67,6 +69,11 @@ bool readLink(int directory, const char* path, std::string& target) {
     }
     target.assign(buffer.data(), static_cast<size_t>(length));
     return true;
+}
+
+uint64_t readNamespace(int processDirectory, const std::string& kind) {
+    std::string target;
+    return readLink(processDirectory, ("ns/" + kind).c_str(), target) ? parseNamespace(target) : 0;
 }
 
 }  // namespace procfs

@@ -40,4 +40,7 @@ bool readFile(int directory, const char* path, std::string& text, size_t limit =
 /// The target of a symbolic link; false with errno on failure.
 bool readLink(int directory, const char* path, std::string& target);
 
+/// The namespace of this kind ("ipc", "mnt") of the process with this directory; 0 when it cannot be read.
+uint64_t readNamespace(int processDirectory, const std::string& kind);
+
 }  // namespace procfs

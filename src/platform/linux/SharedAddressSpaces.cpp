@@ -4,6 +4,10 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <cerrno>
+#include <cstddef>
+#include <iterator>
+
 namespace {
 
 // 0: one address space; 1 and 2: below and above in an order of the kernel's own; 3 or negative: cannot say.
@@ -13,18 +17,21 @@ long compareSpaces(int32_t thread, int32_t otherThread) {
 
 }  // namespace
 
-// Where the space of `thread` stands among the members; those that have ended since cannot be compared with
-// and are forgotten.
-SharedAddressSpaces::Members::iterator SharedAddressSpaces::_place(Members& members, int32_t thread) {
-    auto first = members.begin();
-    auto last = members.end();
+// Where the space of `thread` stands among the members, or none when the kernel does not compare. Members
+// that have ended since are forgotten.
+std::optional<size_t> SharedAddressSpaces::_place(Members& members, int32_t thread) {
+    size_t first = 0;
+    size_t last = members.size();
     while (first != last) {
-        const auto middle = first + (last - first) / 2;
-        const long order = compareSpaces(middle->thread, thread);
+        const size_t middle = first + (last - first) / 2;
+        const long order = compareSpaces(members[middle].thread, thread);
         if (order < 0) {
-            members.erase(middle);
-            first = members.begin();
-            last = members.end();
+            if (errno != ESRCH || compareSpaces(thread, thread) < 0) {
+                return std::nullopt;
+            }
+            members.erase(members.begin() + static_cast<ptrdiff_t>(middle));
+            first = 0;
+            last = members.size();
         } else if (order == 1) {
             first = middle + 1;
         } else {
@@ -38,9 +45,20 @@ ProcessIdentity SharedAddressSpaces::ownerOf(const Candidate& candidate) {
     const std::lock_guard lock(_mutex);
     Members& members = _members[candidate.startStack];
     const auto place = _place(members, candidate.thread);
-    if (place != members.end() && compareSpaces(place->thread, candidate.thread) == 0) {
-        return place->process;
+    if (!place) {
+        return candidate.process;
     }
-    members.insert(place, {candidate.process, candidate.thread});
+    if (*place < members.size() && compareSpaces(members[*place].thread, candidate.thread) == 0) {
+        return members[*place].process;
+    }
+    members.insert(members.begin() + static_cast<ptrdiff_t>(*place), {candidate.process, candidate.thread});
     return candidate.process;
+}
+
+void SharedAddressSpaces::forget(const ProcessIdentity& process) {
+    const std::lock_guard lock(_mutex);
+    for (auto entry = _members.begin(); entry != _members.end();) {
+        std::erase_if(entry->second, [&](const Member& member) { return member.process == process; });
+        entry = entry->second.empty() ? _members.erase(entry) : std::next(entry);
+    }
 }

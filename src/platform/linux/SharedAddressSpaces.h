@@ -3,12 +3,15 @@
 #include <cstdint>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <vector>
 
 /// A process by what names it for good: its pid can be given away, its start time cannot.
 struct ProcessIdentity {
     int32_t pid = 0;
     uint64_t startTime = 0;  ///< clock ticks since boot
+
+    bool operator==(const ProcessIdentity&) const = default;
 };
 
 /// Processes that share one address space outright (vfork, CLONE_VM): everything private to one of them is
@@ -25,6 +28,8 @@ public:
     /// Under whose name the memory of this process goes: its own, or that of the first process met with the
     /// same address space. Costs nothing for a program that runs once, else log n calls of kcmp.
     ProcessIdentity ownerOf(const Candidate& candidate);
+    /// The process is not looked at any more.
+    void forget(const ProcessIdentity& process);
 
 private:
     struct Member {
@@ -33,7 +38,7 @@ private:
     };
     using Members = std::vector<Member>;
 
-    static Members::iterator _place(Members& members, int32_t thread);
+    static std::optional<size_t> _place(Members& members, int32_t thread);
 
     std::mutex _mutex;
     std::map<uint64_t, Members> _members;  ///< by start of stack, in the kernel's order of spaces

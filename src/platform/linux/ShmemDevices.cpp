@@ -44,16 +44,35 @@ ShmemDevices::ShmemDevices() {
     }
 }
 
-bool ShmemDevices::isShmem(uint64_t device, int processDirectory) {
+std::optional<bool> ShmemDevices::_known(uint64_t device, uint64_t mountNamespace) {
     const std::lock_guard lock(_mutex);
-    const auto known = _isShmem.find(device);
-    if (known != _isShmem.end()) {
+    if (const auto known = _isShmem.find(device); known != _isShmem.end()) {
         return known->second;
     }
+    return _notMounted.contains({mountNamespace, device}) ? std::optional(false) : std::nullopt;
+}
+
+bool ShmemDevices::isShmem(uint64_t device, int processDirectory) {
+    constexpr size_t kLongestMountinfo = 64U << 20U;
+    if (const auto known = _known(device, 0)) {
+        return *known;
+    }
+    const uint64_t mountNamespace = procfs::readNamespace(processDirectory, "mnt");
+    if (const auto known = _known(device, mountNamespace)) {
+        return *known;
+    }
     std::string text;
-    procfs::readFile(processDirectory, "mountinfo", text);
+    const bool read =
+        procfs::readFile(processDirectory, "mountinfo", text, kLongestMountinfo) && !text.empty();
+    const std::lock_guard lock(_mutex);
     for (const procfs::Mount& mount : procfs::parseMountinfo(text)) {
         _isShmem.emplace(mount.device, mount.fileSystem == "tmpfs" || mount.fileSystem == "ramfs");
     }
-    return _isShmem.emplace(device, false).first->second;
+    if (const auto found = _isShmem.find(device); found != _isShmem.end()) {
+        return found->second;
+    }
+    if (read && mountNamespace != 0) {
+        _notMounted.emplace(mountNamespace, device);
+    }
+    return false;
 }

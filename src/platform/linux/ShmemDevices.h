@@ -2,8 +2,11 @@
 
 #include <cstdint>
 #include <mutex>
+#include <optional>
+#include <set>
 #include <string_view>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 namespace procfs {
@@ -25,11 +28,15 @@ class ShmemDevices {
 public:
     ShmemDevices();
 
-    /// `processDirectory` is where an unknown device is looked up (`mountinfo`); a device that is mounted
-    /// nowhere there counts as a disk.
+    /// `processDirectory` is where an unknown device is looked up (`mountinfo`). A device that is mounted
+    /// nowhere there (the layers of an overlay, for one) counts as a disk, for the processes of that mount
+    /// namespace only: what one process cannot see another may have mounted.
     bool isShmem(uint64_t device, int processDirectory);
 
 private:
+    std::optional<bool> _known(uint64_t device, uint64_t mountNamespace);
+
     std::mutex _mutex;
     std::unordered_map<uint64_t, bool> _isShmem;
+    std::set<std::pair<uint64_t, uint64_t>> _notMounted;  ///< mount namespace and device
 };

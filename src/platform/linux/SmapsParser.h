@@ -55,6 +55,7 @@ struct Vma {
     uint64_t swapPss = 0;
 
     uint64_t size() const { return end - start; }
+    uint64_t resident() const { return rss + sharedHugetlb + privateHugetlb; }
     uint64_t device() const { return (uint64_t{deviceMajor} << 32U) | deviceMinor; }
     bool has(VmFlag flag) const { return (flags & flag) != 0; }
 };

@@ -1,0 +1,30 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstdint>
+#include <map>
+#include <set>
+#include <string>
+#include <vector>
+
+/// What one run of the program reports, as far as the accuracy tests look at it. Sizes are bytes, dirty and
+/// swapped together.
+struct Measurement {
+    uint64_t summary = 0;
+    std::map<pid_t, uint64_t> charges;
+    /// Of each process: the sums of its tables, by the processes that share the memory (itself included).
+    std::map<pid_t, std::map<std::set<pid_t>, uint64_t>> tables;
+    std::map<pid_t, std::vector<uint64_t>> regionStarts;
+    std::vector<std::string> errors;
+    std::chrono::nanoseconds duration = {};
+};
+
+/// Measures these processes, in the mode that breaks the physical charge down, on a live host of its own.
+Measurement measure(const std::vector<pid_t>& pids);
+/// Measures everything but the kernel.
+Measurement measureAll();
+/// The summary and the charges, in the order of the pids, as another user without capabilities measures
+/// them.
+std::vector<uint64_t> measureAsUser(uid_t user, const std::vector<pid_t>& pids);

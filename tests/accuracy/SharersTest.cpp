@@ -1,0 +1,81 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include "accuracy/Figures.h"
+#include "accuracy/Measurement.h"
+#include "accuracy/Workload.h"
+
+// Who is told to share memory with whom. Needs no privilege to be right.
+
+namespace {
+
+constexpr uint64_t kTolerance = 4U << 20U;
+
+using Names = std::set<std::string>;
+
+/// Bytes for each set of sharers that `name` is told to share with; small sums (the C library's few written
+/// pages) are left out.
+std::map<Names, uint64_t> tableOf(const Workload& workload, const Measurement& measurement,
+                                  const std::string& name) {
+    std::map<pid_t, std::string> names;
+    for (const auto& [known, pid] : workload.names()) {
+        names[pid] = known;
+    }
+    std::map<Names, uint64_t> table;
+    for (const auto& [pids, bytes] : measurement.tables.at(workload.pid(name))) {
+        Names sharers;
+        for (const pid_t pid : pids) {
+            sharers.insert(names.at(pid));
+        }
+        if (bytes > kTolerance) {
+            table[sharers] = bytes;
+        }
+    }
+    return table;
+}
+
+void expectTable(const std::map<Names, uint64_t>& table, const std::map<Names, uint64_t>& expected) {
+    for (const auto& [sharers, bytes] : table) {
+        EXPECT_TRUE(expected.contains(sharers))
+            << testing::PrintToString(sharers) << " share " << (bytes >> 20U) << " MiB";
+    }
+    for (const auto& [sharers, bytes] : expected) {
+        const auto found = table.find(sharers);
+        const uint64_t measured = found == table.end() ? 0 : found->second;
+        EXPECT_LE(std::max(measured, bytes) - std::min(measured, bytes), kTolerance)
+            << testing::PrintToString(sharers) << " share " << (measured >> 20U) << " MiB, not "
+            << (bytes >> 20U);
+    }
+}
+
+}  // namespace
+
+TEST(Sharers, AreThoseForkedAfterTheMemoryWasTouched) {
+    const Workload family("touched-between-forks", {scaled(256), scaled(100)});
+    const Measurement measurement = measure(family.pids());
+    const uint64_t first = scaledBytes(256);
+    const uint64_t second = scaledBytes(100);
+    const Names all = {"root", "A", "B"};
+    expectTable(tableOf(family, measurement, "root"), {{all, first}, {{"root", "B"}, second}});
+    expectTable(tableOf(family, measurement, "A"), {{all, first}});
+    expectTable(tableOf(family, measurement, "B"), {{all, first}, {{"root", "B"}, second}});
+}
+
+// The sibling and its child have new frames for the first half; who was there in between has ended.
+TEST(Sharers, FollowTheFramesThroughGenerations) {
+    const Workload family("descendants", {scaled(128)});
+    const Measurement measurement = measure(family.pids());
+    const uint64_t half = scaledBytes(64);
+    const Names old = {"root", "A", "AA", "AAA", "orphan"};
+    Names all = old;
+    all.insert({"sibling", "nephew"});
+    const Names rewriters = {"sibling", "nephew"};
+    for (const std::string& name : old) {
+        SCOPED_TRACE(name);
+        expectTable(tableOf(family, measurement, name), {{old, half}, {all, half}});
+    }
+    for (const std::string& name : rewriters) {
+        SCOPED_TRACE(name);
+        expectTable(tableOf(family, measurement, name), {{rewriters, half}, {all, half}});
+    }
+}
