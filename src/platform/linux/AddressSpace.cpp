@@ -148,7 +148,8 @@ public:
 
 private:
     /// What tells the memory of one window apart: each use of it has a name of its own, so it is an object of
-    /// its own. A file's memory is named for the file and not by the tag, which can differ within it.
+    /// its own. A file's memory is named for the file, its data apart from its constants, and not by the tag,
+    /// which can differ within it.
     struct Use {
         uint32_t tag;
         uint64_t file;
@@ -289,7 +290,7 @@ private:
         const uint64_t window = run.start / MWFamilyWindow * MWFamilyWindow;
         return {_context.identity.family({.family = _family().identifier(),
                                           .window = window,
-                                          .file = use.file,
+                                          .file = use.file == 0 ? 0 : use.file + (vma.writable ? 1 : 0),
                                           .tag = use.file == 0 ? use.tag : MWTagNone,
                                           .generation = run.generation}),
                 run.start};
