@@ -22,11 +22,6 @@ void copyText(std::array<char, N>& to, const std::string& from) {
     std::copy_n(from.begin(), std::min(from.size(), N), to.begin());
 }
 
-int noSuchProcess() {
-    errno = ESRCH;
-    return -1;
-}
-
 class FakeImageCursor : public MWImageDescription {
 public:
     explicit FakeImageCursor(const FakeImage& image) : _image(image) {}
@@ -63,9 +58,18 @@ void FakeHost::_count(const std::string& operation) {
     _asked[operation] += 1;
 }
 
-FakeProcess* FakeHost::_find(int32_t pid) {
+int FakeHost::_fail(int error) {
+    errno = error;
+    return -1;
+}
+
+const FakeProcess* FakeHost::_find(int32_t pid) {
     const auto found = processes.find(pid);
-    return found == processes.end() ? nullptr : &found->second;
+    if (found == processes.end() || found->second.gone) {
+        errno = ESRCH;
+        return nullptr;
+    }
+    return &found->second;
 }
 
 const FakeRegion* FakeHost::_regionAtOrAbove(task_t task, uint64_t address) {
@@ -95,10 +99,6 @@ void FakeHost::task_release(task_t task) {
     openTasks.erase(task);
 }
 
-bool FakeHost::hasSharedCache(task_t) {
-    return sharedCache;
-}
-
 kern_return_t FakeHost::mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t&,
                                                vm_region_submap_info_64& info, uint32_t& count) {
     _count("mach_vm_region_recurse");
@@ -126,7 +126,7 @@ kern_return_t FakeHost::mach_vm_region(task_t task, uint64_t& address, uint64_t&
     _count("mach_vm_region");
     const FakeProcess& process = processes.at(pidOfTask(task));
     if (address >= process.mappingFailureFrom) {
-        return process.mappingFailure;
+        return KERN_FAILURE;
     }
     const FakeRegion* region = _regionAtOrAbove(task, address);
     if (region == nullptr) {
@@ -134,15 +134,9 @@ kern_return_t FakeHost::mach_vm_region(task_t task, uint64_t& address, uint64_t&
     }
     address = region->start;
     size = region->size;
-    info.protection = region->info.protection;
-    info.max_protection = region->info.max_protection;
     info.offset = region->info.offset;
     info.user_wired_count = region->info.user_wired_count;
     return KERN_SUCCESS;
-}
-
-std::vector<std::string> FakeHost::takeTaskWarnings(task_t task) {
-    return std::exchange(processes.at(pidOfTask(task)).taskWarnings, {});
 }
 
 kern_return_t FakeHost::mach_vm_purgable_control(task_t task, uint64_t address, int32_t, int32_t& state) {
@@ -156,7 +150,6 @@ kern_return_t FakeHost::mach_vm_purgable_control(task_t task, uint64_t address, 
 
 kern_return_t FakeHost::mach_vm_page_range_query(task_t task, uint64_t start, uint64_t length,
                                                  std::span<int32_t> dispositions, uint64_t& count) {
-    _count("mach_vm_page_range_query");
     const FakeProcess& process = processes.at(pidOfTask(task));
     if (process.pageQueryFailure != KERN_SUCCESS) {
         return process.pageQueryFailure;
@@ -171,8 +164,7 @@ kern_return_t FakeHost::mach_vm_page_range_query(task_t task, uint64_t start, ui
         const FakeRegion* region = _regionAtOrAbove(task, address);
         dispositions[page] = 0;
         if (region != nullptr && address + pageSize > region->start) {
-            const uint64_t base = region->start / pageSize * pageSize;
-            const uint64_t index = (address - base) / pageSize;
+            const uint64_t index = address / pageSize - region->start / pageSize;
             dispositions[page] = index < region->pages.size() ? region->pages[index] : 0;
         }
     }
@@ -180,7 +172,6 @@ kern_return_t FakeHost::mach_vm_page_range_query(task_t task, uint64_t start, ui
 }
 
 int FakeHost::proc_regionfilename(int32_t pid, uint64_t address, std::span<char> path) {
-    _count("proc_regionfilename");
     const FakeRegion* region = _regionAtOrAbove(static_cast<task_t>(pid) << kTaskShift, address);
     if (region == nullptr || processes.at(pid).gone) {
         return 0;
@@ -191,10 +182,9 @@ int FakeHost::proc_regionfilename(int32_t pid, uint64_t address, std::span<char>
 }
 
 int FakeHost::proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) {
-    _count("proc_pidinfo.short");
     const FakeProcess* process = _find(pid);
-    if (process == nullptr || process->gone) {
-        return noSuchProcess();
+    if (process == nullptr) {
+        return -1;
     }
     record = {};
     record.pbsi_pid = static_cast<uint32_t>(pid);
@@ -205,8 +195,8 @@ int FakeHost::proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) {
 int FakeHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     _count("proc_pidinfo.full");
     const FakeProcess* process = _find(pid);
-    if (process == nullptr || process->gone) {
-        return noSuchProcess();
+    if (process == nullptr) {
+        return -1;
     }
     record = {};
     record.pbi_flags = process->flags;
@@ -222,74 +212,38 @@ int FakeHost::proc_listallpids(std::span<int32_t> pids) {
     if (processListFails) {
         return -1;
     }
-    size_t index = 0;
-    for (const auto& [pid, process] : processes) {
-        if (index < pids.size()) {
-            pids[index++] = pid;
-        }
+    auto free = pids.begin();
+    for (auto process = processes.begin(); process != processes.end() && free != pids.end(); ++process) {
+        *free++ = process->first;
     }
-    return static_cast<int>(pids.empty() ? processes.size() : index);
-}
-
-int FakeHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
-    const FakeProcess* process = _find(pid);
-    if (process == nullptr || process->gone) {
-        return noSuchProcess();
-    }
-    record = process->usage;
-    return 0;
+    return static_cast<int>(pids.empty() ? processes.size() : static_cast<size_t>(free - pids.begin()));
 }
 
 int FakeHost::proc_get_dirty(int32_t pid, uint32_t& flags) {
     const FakeProcess* process = _find(pid);
-    if (process == nullptr || process->gone) {
-        return noSuchProcess();
+    if (process == nullptr) {
+        return -1;
     }
     flags = process->dirtyFlags;
     return 0;
 }
 
-int FakeHost::sysctlArgumentMaximum(uint64_t& bytes) {
-    bytes = 4096;
-    return 0;
-}
-
 int FakeHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) {
-    _count("sysctlArgumentArea");
     const FakeProcess* process = _find(pid);
     if (process == nullptr || process->executable.empty()) {
-        errno = EINVAL;
-        return -1;
+        return _fail(EINVAL);
     }
-    const int32_t argumentCount = 1;
-    std::string bytes(reinterpret_cast<const char*>(&argumentCount), sizeof(argumentCount));
-    bytes += process->executable;
-    bytes += std::string(3, '\0');
+    // The argument count, then the path.
+    const std::string bytes = std::string(4, '\1') + process->executable + std::string(3, '\0');
     length = std::min(bytes.size(), area.size());
     std::copy_n(bytes.begin(), length, area.begin());
     return 0;
 }
 
-int FakeHost::ledgerTemplate(std::span<ledger_template_info>, size_t&) {
-    errno = ENOTSUP;
-    return -1;
-}
-
-int FakeHost::ledgerEntries(int32_t, std::span<ledger_entry_info>, size_t&) {
-    errno = ENOTSUP;
-    return -1;
-}
-
-int FakeHost::sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) {
-    errno = ENOENT;
-    return -1;
-}
-
 int FakeHost::sysctlSelfRegionMemweight(int32_t& value) {
     _count("sysctlSelfRegionMemweight");
     if (selfRegionMemweightError != 0) {
-        errno = selfRegionMemweightError;
-        return -1;
+        return _fail(selfRegionMemweightError);
     }
     value = selfRegionMemweight;
     return 0;
@@ -297,15 +251,10 @@ int FakeHost::sysctlSelfRegionMemweight(int32_t& value) {
 
 int FakeHost::setSysctlSelfRegionMemweight(int32_t value) {
     if (selfRegionMemweightError != 0) {
-        errno = selfRegionMemweightError;
-        return -1;
+        return _fail(selfRegionMemweightError);
     }
     selfRegionMemweight = value;
     return 0;
-}
-
-std::string FakeHost::mach_error_string(kern_return_t code) {
-    return "code " + std::to_string(code);
 }
 
 void FakeHost::mach_error(std::string_view label, kern_return_t code) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cerrno>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -40,14 +41,10 @@ struct FakeProcess {
     /// What the walk answers once `regionsBeforeFailure` regions were delivered, when not KERN_SUCCESS.
     kern_return_t walkFailure = KERN_SUCCESS;
     size_t regionsBeforeFailure = 0;
-    /// What mach_vm_region answers from this address on.
-    uint64_t mappingFailureFrom = UINT64_MAX;
-    kern_return_t mappingFailure = KERN_FAILURE;
+    uint64_t mappingFailureFrom = UINT64_MAX;  ///< from here on mach_vm_region fails
     kern_return_t pageQueryFailure = KERN_SUCCESS;
-    std::vector<std::string> taskWarnings = {};
     bool gone = false;  ///< proc_pidinfo fails with ESRCH
     uint32_t dirtyFlags = 0;
-    rusage_info_v5 usage = {};
 };
 
 /// The system on a page: a test fills `processes` and reads back what was asked. Installs itself as the
@@ -67,7 +64,6 @@ public:
     bool processListFails = false;
     MWClockReading clock = {1000, 2000, 978307200, 500000000};
     bool clockFails = false;
-    mach_timebase_info_t timebase = {1, 1};
     int32_t ownPid = 99999;
     uint32_t effectiveUser = 0;
     std::set<int> terminals;
@@ -83,10 +79,9 @@ public:
 
     kern_return_t task_read_for_pid(int32_t pid, task_t& task) override;
     void task_release(task_t task) override;
-    bool hasSharedCache(task_t task) override;
+    bool hasSharedCache(task_t) override { return sharedCache; }
     kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
                                          vm_region_submap_info_64& info, uint32_t& count) override;
-    std::vector<std::string> takeTaskWarnings(task_t task) override;
     kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                  vm_region_basic_info_64& info, uint32_t& count) override;
     kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control,
@@ -97,22 +92,25 @@ public:
     int proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) override;
     int proc_pidinfo(int32_t pid, proc_bsdinfo& record) override;
     int proc_listallpids(std::span<int32_t> pids) override;
-    int proc_pid_rusage(int32_t pid, rusage_info_v5& record) override;
+    int proc_pid_rusage(int32_t, rusage_info_v5&) override { return _fail(ESRCH); }
     int proc_get_dirty(int32_t pid, uint32_t& flags) override;
-    int sysctlArgumentMaximum(uint64_t& bytes) override;
+    int sysctlArgumentMaximum(uint64_t& bytes) override {
+        bytes = 4096;
+        return 0;
+    }
     int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
-    int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
-    int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
-    int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
+    int ledgerTemplate(std::span<ledger_template_info>, size_t&) override { return _fail(ENOTSUP); }
+    int ledgerEntries(int32_t, std::span<ledger_entry_info>, size_t&) override { return _fail(ENOTSUP); }
+    int sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) override { return _fail(ENOENT); }
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;
     uint64_t vm_kernel_page_size() override { return pageSize; }
-    std::string mach_error_string(kern_return_t code) override;
+    std::string mach_error_string(kern_return_t code) override { return "code " + std::to_string(code); }
     void mach_error(std::string_view label, kern_return_t code) override;
     std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
     void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
     int mach_get_times(MWClockReading& reading) override;
-    mach_timebase_info_t mach_timebase_info() override { return timebase; }
+    mach_timebase_info_t mach_timebase_info() override { return {1, 1}; }
     int32_t getpid() override { return ownPid; }
     uint32_t geteuid() override { return effectiveUser; }
     bool isatty(int descriptor) override { return terminals.contains(descriptor); }
@@ -121,7 +119,10 @@ public:
 
 private:
     void _count(const std::string& operation);
-    FakeProcess* _find(int32_t pid);
+    /// errno's value, and the failure that goes with it.
+    static int _fail(int error);
+    /// None, and errno ESRCH, when there is no such process (any more).
+    const FakeProcess* _find(int32_t pid);
     const FakeRegion* _regionAtOrAbove(task_t task, uint64_t address);
 
     MWHostInterface* _previous;
