@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <optional>
 
 #include "accuracy/Figures.h"
 #include "accuracy/Measurement.h"
@@ -24,12 +25,15 @@ protected:
 namespace {
 
 constexpr uid_t kNobody = 65534;
-constexpr uint64_t kMiB = 1U << 20U;
+
+/// Who measures: root, or a user.
+using User = std::optional<uid_t>;
 
 /// The sum of all processes, and the charge of each, against the kernel's own figures.
-void expectTrueSums(const std::string& scenario, const std::vector<pid_t>& pids) {
-    const Measurement measurement = measure(pids);
+void expectTrueSums(std::string scenario, const std::vector<pid_t>& pids, User user = {}) {
+    const Measurement measurement = user ? measureAsUser(*user, pids) : measure(pids);
     EXPECT_EQ(measurement.errors, std::vector<std::string>());
+    scenario += user ? ", not root" : "";
     expectNear({scenario, measurement.summary, physicalMemoryOf(pids)});
     for (const pid_t pid : pids) {
         expectNear(
@@ -37,115 +41,99 @@ void expectTrueSums(const std::string& scenario, const std::vector<pid_t>& pids)
     }
 }
 
-void expectTrueSumsForUser(const std::string& scenario, const std::vector<pid_t>& pids) {
-    const std::vector<uint64_t> figures = measureAsUser(kNobody, pids);
-    expectNear({scenario, figures[0], physicalMemoryOf(pids)});
-    for (size_t i = 0; i < pids.size(); ++i) {
-        expectNear({fmt::format("{}: charge of {}", scenario, pids[i]), figures[i + 1], chargeOf(pids[i])});
-    }
+std::string forkTree(uint64_t rewrittenLater) {
+    return fmt::format("fork-tree {} 16 {} {}", scaled(256), isFullRun() ? 10 : 3, rewrittenLater);
 }
 
-std::vector<std::string> forkTree(const std::string& rewrittenLater) {
-    return {scaled(256), "16", isFullRun() ? "10" : "3", rewrittenLater};
-}
+class AccuracyForUser : public Accuracy, public testing::WithParamInterface<User> {};
+
+INSTANTIATE_TEST_SUITE_P(Users, AccuracyForUser, testing::Values(User(), User(kNobody)),
+                         [](const auto& user) { return user.param ? "Nobody" : "Root"; });
 
 }  // namespace
 
-TEST_F(Accuracy, ForkTree) {
-    const Workload tree("fork-tree", forkTree("0"));
+TEST_P(AccuracyForUser, ForkTree) {
+    const Workload tree(forkTree(0), {.user = GetParam()});
     ASSERT_EQ(tree.pids().size(), 18U);
-    expectTrueSums("fork tree", tree.pids());
+    expectTrueSums("fork tree", tree.pids(), GetParam());
 }
 
-TEST_F(Accuracy, ForkTreeWithoutPrivilege) {
-    const Workload tree("fork-tree", forkTree("0"), {.user = kNobody});
-    expectTrueSumsForUser("fork tree, not root", tree.pids());
+TEST_P(AccuracyForUser, PrivateMappingsOfAFile) {
+    const auto directory = temporaryDirectory("/var/tmp");
+    writeCleanFile(*directory / "file", scaled(256));
+    const Workload processes(fmt::format("private-file {} 8", (*directory / "file").string()),
+                             {.user = GetParam()});
+    expectTrueSums("private mappings of a file", processes.pids(), GetParam());
+}
+
+// Nothing in these address spaces tells them apart, and a fork of each makes their memory look shared.
+TEST_P(AccuracyForUser, UnrelatedRunsAtTheSameAddresses) {
+    const std::string scenario = fmt::format("fork-tree {} 1 1 0", scaled(64));
+    const Workload::Conditions sameAddresses = {.user = GetParam(), .hasRandomAddresses = false};
+    const Workload first(scenario, sameAddresses);
+    const Workload second(scenario, sameAddresses);
+    ASSERT_EQ(largestMapping(first.pid("root")).start, largestMapping(second.pid("root")).start);
+    auto pids = first.pids();
+    for (const pid_t pid : second.pids()) {
+        pids.push_back(pid);
+    }
+    expectTrueSums("unrelated runs at the same addresses", pids, GetParam());
 }
 
 TEST_F(Accuracy, GenerationsOfAForkTree) {
-    const Workload tree("fork-tree", forkTree(scaled(64)));
+    const Workload tree(forkTree(scaled(64)));
     ASSERT_EQ(tree.pids().size(), 21U);
     expectTrueSums("fork tree with generations", tree.pids());
 }
 
 TEST_F(Accuracy, SharedObjectsInDifferentRanges) {
-    const TemporaryDirectory disk("/var/tmp");
-    const TemporaryDirectory memory("/dev/shm");
-    const Workload sharers("shared-objects", {"8", scaled(64), disk / "file", memory / "file"});
+    const auto disk = temporaryDirectory("/var/tmp");
+    const auto memory = temporaryDirectory("/dev/shm");
+    const Workload sharers(fmt::format("shared-objects 8 {} {} {}", scaled(64), (*disk / "file").string(),
+                                       (*memory / "file").string()));
     expectTrueSums("shared objects", sharers.pids());
 }
 
 TEST_F(Accuracy, KindsOfPages) {
-    const SwapFile swap(scaledBytes(256));
-    const HugePages hugePages(scaledBytes(32) / (2 * kMiB));
-    if (!swap.isUsed() || !hugePages.areThere()) {
+    const auto swap = swapFile(scaled(256));
+    const auto huge = hugePages(scaled(32) / 2);
+    if (!swap || !huge) {
         GTEST_SKIP() << "no swap file or no huge pages to be had";
     }
-    const Workload process("page-kinds", {scaled(32)});
+    const Workload process(fmt::format("page-kinds {}", scaled(32)));
     expectTrueSums("kinds of pages", process.pids());
 }
 
-TEST_F(Accuracy, PrivateMappingsOfAFile) {
-    const TemporaryDirectory directory("/var/tmp");
-    writeCleanFile(directory / "file", scaledBytes(256));
-    const Workload processes("private-file", {directory / "file", "8"});
-    expectTrueSums("private mappings of a file", processes.pids());
-}
-
-TEST_F(Accuracy, PrivateMappingsOfAFileWithoutPrivilege) {
-    const TemporaryDirectory directory("/var/tmp");
-    writeCleanFile(directory / "file", scaledBytes(256));
-    const Workload processes("private-file", {directory / "file", "8"}, {.user = kNobody});
-    expectTrueSumsForUser("private mappings of a file, not root", processes.pids());
-}
-
-// Nothing in these address spaces tells them apart, and a fork of each makes their memory look shared.
-TEST_F(Accuracy, UnrelatedRunsAtTheSameAddresses) {
-    const Workload::Conditions sameAddresses = {.user = std::nullopt, .hasRandomAddresses = false};
-    const Workload first("fork-tree", {scaled(64), "1", "1", "0"}, sameAddresses);
-    const Workload second("fork-tree", {scaled(64), "1", "1", "0"}, sameAddresses);
-    ASSERT_EQ(largestMapping(first.pid("root")).start, largestMapping(second.pid("root")).start);
-    expectTrueSums("unrelated runs at the same addresses", pidsOf({&first, &second}));
-}
-
-TEST_F(Accuracy, UnrelatedRunsAtTheSameAddressesWithoutPrivilege) {
-    const Workload::Conditions sameAddresses = {.user = kNobody, .hasRandomAddresses = false};
-    const Workload first("fork-tree", {scaled(64), "1", "1", "0"}, sameAddresses);
-    const Workload second("fork-tree", {scaled(64), "1", "1", "0"}, sameAddresses);
-    expectTrueSumsForUser("unrelated runs at the same addresses, not root", pidsOf({&first, &second}));
-}
-
 TEST_F(Accuracy, SwappedOutBeforeForks) {
-    const SwapFile swap(scaledBytes(128));
-    if (!swap.isUsed()) {
+    const auto swap = swapFile(scaled(128));
+    if (!swap) {
         GTEST_SKIP() << "no swap file to be had";
     }
-    const Workload family("swapped-then-forked", {scaled(64), "8"});
+    const Workload family(fmt::format("swapped-then-forked {} 8", scaled(64)));
     expectTrueSums("swapped out before 8 forks", family.pids());
 }
 
 TEST_F(Accuracy, IdenticalChildrenOfAParentThatExecs) {
-    const Workload family("orphans-of-exec", {scaled(16), "16"});
+    const Workload family(fmt::format("orphans-of-exec {} 16", scaled(16)));
     expectTrueSums("16 children of a parent that execs", family.pids());
     EXPECT_GE(measure(family.pids()).summary, 16 * scaledBytes(16));
 }
 
 TEST_F(Accuracy, OneAddressSpaceOfTwoProcesses) {
-    const Workload twins("one-address-space", {scaled(64)});
+    const Workload twins(fmt::format("one-address-space {}", scaled(64)));
     ASSERT_EQ(twins.pids().size(), 2U);
     expectTrueSums("two processes, one address space", twins.pids());
 }
 
 TEST_F(Accuracy, WithoutItsFirstThread) {
-    const Workload process("without-first-thread", {scaled(64)});
-    const Measurement measurement = measure(process.pids());
-    expectNear({"without its first thread", measurement.summary, scaledBytes(64)}, 2);
+    const Workload process(fmt::format("without-first-thread {}", scaled(64)));
+    expectNear({"without its first thread", measure(process.pids()).summary, scaledBytes(64)}, 2);
 }
 
 // Other processes come and go meanwhile, so the truth is what was in use before or after. With a large tree
 // the kernel's own rounding (its counters are kept for each processor) and what ends just now stay small.
 TEST_F(Accuracy, WholeSystem) {
-    const Workload tree("fork-tree", {"768", "4", "8", "0"});
+    const Workload tree("fork-tree 768 4 8 0");
     const uint64_t before = memoryInUse();
     const Measurement measurement = measureAll();
     const uint64_t after = memoryInUse();
@@ -154,7 +142,7 @@ TEST_F(Accuracy, WholeSystem) {
 }
 
 TEST_F(Accuracy, AlternatingPagesMakeFewRegions) {
-    const Workload family("alternating", {scaled(1024), "1"});
+    const Workload family(fmt::format("alternating {} 1", scaled(1024)));
     const pid_t pid = family.pid("root");
     const Measurement measurement = measure(family.pids());
     const AddressRange mapping = largestMapping(pid);
@@ -165,30 +153,19 @@ TEST_F(Accuracy, AlternatingPagesMakeFewRegions) {
     expectTrueSums("alternating pages", family.pids());
 }
 
-namespace {
-
-std::chrono::nanoseconds shortestMeasurement(pid_t pid) {
-    constexpr int kAttempts = 7;
-    std::chrono::nanoseconds shortest = std::chrono::nanoseconds::max();
-    for (int attempt = 0; attempt < kAttempts; ++attempt) {
-        shortest = std::min(shortest, measure({pid}).duration);
-    }
-    return shortest;
-}
-
-}  // namespace
-
 // A benchmark: nothing is asserted of times.
 TEST_F(Accuracy, TimeForAlternatingPages) {
     if (!isFullRun()) {
         GTEST_SKIP() << "a benchmark";
     }
-    const Workload forked("alternating", {scaled(1024), "1"});
-    const Workload alone("alternating", {scaled(1024), "0"});
-    const auto forkedTime = shortestMeasurement(forked.pid("root"));
-    const auto aloneTime = shortestMeasurement(alone.pid("root"));
-    addRemark(fmt::format(
-        "alternating pages: measured in {:.2f} ms after a fork, {:.2f} ms without: {:.2f} times",
-        static_cast<double>(forkedTime.count()) / 1e6, static_cast<double>(aloneTime.count()) / 1e6,
-        static_cast<double>(forkedTime.count()) / static_cast<double>(aloneTime.count())));
+    std::vector<std::chrono::duration<double, std::milli>> times;
+    for (const int forked : {0, 1}) {
+        const Workload family(fmt::format("alternating {} {}", scaled(1024), forked));
+        times.emplace_back(std::chrono::hours(1));
+        for (int attempt = 0; attempt < 7; ++attempt) {
+            times.back() = std::min(times.back(), {measure({family.pid("root")}).duration});
+        }
+    }
+    fmt::print("alternating pages: {:.2f} ms after a fork, {:.2f} ms without: {:.2f} times\n",
+               times[1].count(), times[0].count(), times[1] / times[0]);
 }

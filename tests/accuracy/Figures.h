@@ -6,8 +6,8 @@
 /// Whether the scenarios have their full sizes and their figures are printed; otherwise they are a quarter
 /// as large. (MEMWEIGHT_ACCURACY=full in the environment.)
 bool isFullRun();
-/// So many MiB in a full run, a quarter otherwise; as a workload's argument.
-std::string scaled(uint64_t mebibytes);
+/// So many MiB in a full run, a quarter otherwise; and as bytes.
+uint64_t scaled(uint64_t mebibytes);
 uint64_t scaledBytes(uint64_t mebibytes);
 
 struct Figure {
@@ -18,7 +18,3 @@ struct Figure {
 
 /// Fails the test when the figure is further from the truth than `percent` of the truth.
 void expectNear(const Figure& figure, double percent = 0.5);
-/// A line that belongs below the table of figures.
-void addRemark(const std::string& remark);
-/// All figures and remarks so far, as a table on standard output.
-void printFigures();

@@ -1,17 +1,17 @@
 #include "accuracy/Measurement.h"
 
-#include <fcntl.h>
-#include <sys/wait.h>
-#include <unistd.h>
+#include <sys/mman.h>
 
-#include <array>
+#include <algorithm>
 #include <memory>
+#include <span>
 #include <stdexcept>
 
 #include "accuracy/Workload.h"
 #include "analysis/MWMemweight.h"
 #include "analysis/MWProcessGroup.h"
 #include "platform/linux/MWLinuxHost.h"
+#include "support/ChildProcess.h"
 
 namespace {
 
@@ -112,38 +112,26 @@ Measurement measureAll() {
     return measureProcesses(std::move(processes));
 }
 
-namespace {
-
-[[noreturn]] void answerAsUser(uid_t user, const std::vector<pid_t>& pids, int pipe) {
-    becomeUser(user);
-    const Measurement measurement = measure(pids);
-    std::vector<uint64_t> answer = {measurement.summary};
-    for (const pid_t pid : pids) {
-        answer.push_back(measurement.charges.at(pid));
+Measurement measureAsUser(uid_t user, const std::vector<pid_t>& pids) {
+    const size_t count = pids.size() + 2;
+    const size_t size = count * sizeof(uint64_t);
+    void* shared = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+    const std::span answer(static_cast<uint64_t*>(shared), count);
+    const ChildProcess measuring([&] {
+        becomeUser(user);
+        const Measurement measurement = measure(pids);
+        answer[0] = measurement.summary;
+        answer[1] = measurement.errors.size();
+        std::transform(pids.begin(), pids.end(), answer.begin() + 2,
+                       [&](pid_t pid) { return measurement.charges.at(pid); });
+        return uint64_t{0};
+    });
+    Measurement measurement;
+    measurement.summary = answer[0];
+    measurement.errors.resize(answer[1], "an error");
+    for (size_t i = 0; i < pids.size(); ++i) {
+        measurement.charges[pids[i]] = answer[i + 2];
     }
-    const size_t size = answer.size() * sizeof(uint64_t);
-    _exit(write(pipe, answer.data(), size) == static_cast<ssize_t>(size) ? 0 : 1);
-}
-
-}  // namespace
-
-std::vector<uint64_t> measureAsUser(uid_t user, const std::vector<pid_t>& pids) {
-    std::array<int, 2> answers = {};
-    pid_t child = -1;
-    if (pipe2(answers.data(), O_CLOEXEC) != 0 || (child = fork()) < 0) {
-        throw std::runtime_error("cannot measure as another user");
-    }
-    if (child == 0) {
-        answerAsUser(user, pids, answers[1]);
-    }
-    close(answers[1]);
-    std::vector<uint64_t> answer(pids.size() + 1);
-    const size_t size = answer.size() * sizeof(uint64_t);
-    const bool answered = read(answers[0], answer.data(), size) == static_cast<ssize_t>(size);
-    close(answers[0]);
-    waitpid(child, nullptr, 0);
-    if (!answered) {
-        throw std::runtime_error("measuring as another user has failed");
-    }
-    return answer;
+    munmap(shared, size);
+    return measurement;
 }

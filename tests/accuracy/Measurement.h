@@ -25,6 +25,5 @@ struct Measurement {
 Measurement measure(const std::vector<pid_t>& pids);
 /// Measures everything but the kernel.
 Measurement measureAll();
-/// The summary and the charges, in the order of the pids, as another user without capabilities measures
-/// them.
-std::vector<uint64_t> measureAsUser(uid_t user, const std::vector<pid_t>& pids);
+/// As another user without capabilities measures them: summary, charges, how many errors.
+Measurement measureAsUser(uid_t user, const std::vector<pid_t>& pids);

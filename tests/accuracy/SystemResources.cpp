@@ -1,86 +1,63 @@
 #include "accuracy/SystemResources.h"
 
 #include <fcntl.h>
-#include <sys/stat.h>
 #include <sys/swap.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstdlib>
 #include <fstream>
 #include <stdexcept>
-#include <vector>
+#include <string>
 
-namespace {
+namespace fs = std::filesystem;
 
-constexpr const char* kHugePagePool = "/proc/sys/vm/nr_hugepages";
-
-uint64_t hugePagesInPool() {
-    uint64_t pages = 0;
-    std::ifstream(kHugePagePool) >> pages;
-    return pages;
-}
-
-void setHugePagesInPool(uint64_t pages) {
-    std::ofstream(kHugePagePool) << pages;
-}
-
-// Written, not allocated: a swap file must have no holes, nor extents that were never written.
-int writeFile(const std::string& path, uint64_t bytes, mode_t mode) {
-    const int file = open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, mode);
-    std::vector<char> block(1U << 20U, 'x');
-    for (uint64_t left = bytes; file >= 0 && left != 0;) {
-        const ssize_t count = write(file, block.data(), std::min<uint64_t>(left, block.size()));
-        if (count <= 0) {
-            break;
-        }
-        left -= static_cast<uint64_t>(count);
-    }
-    struct stat status = {};
-    if (fstat(file, &status) != 0 || static_cast<uint64_t>(status.st_size) != bytes || fsync(file) != 0) {
-        throw std::runtime_error("cannot write " + path);
-    }
-    return file;
-}
-
-bool useForSwap(const std::string& path, uint64_t bytes) {
-    close(writeFile(path, bytes, S_IRUSR | S_IWUSR));
-    const std::string makeSwap = "PATH=$PATH:/usr/sbin:/sbin mkswap '" + path + "' >/dev/null 2>&1";
-    return std::system(makeSwap.c_str()) == 0 && swapon(path.c_str(), 0) == 0;
-}
-
-}  // namespace
-
-TemporaryDirectory::TemporaryDirectory(const std::filesystem::path& parent) {
+std::shared_ptr<const fs::path> temporaryDirectory(const fs::path& parent) {
     std::string name = parent / "accuracy-XXXXXX";
     if (mkdtemp(name.data()) == nullptr) {
         throw std::runtime_error("cannot make a directory in " + parent.string());
     }
-    _path = name;
-    chmod(name.c_str(), S_IRWXU | S_IRGRP | S_IXGRP | S_IROTH | S_IXOTH);
+    fs::permissions(name, fs::perms(0755));
+    return {new fs::path(name), [](const fs::path* path) {
+                std::error_code ignored;
+                fs::remove_all(*path, ignored);
+                delete path;
+            }};
 }
 
-TemporaryDirectory::~TemporaryDirectory() {
-    std::error_code ignored;
-    std::filesystem::remove_all(_path, ignored);
+// Written, not allocated: a swap file must have no holes, nor extents that were never written.
+void writeCleanFile(const fs::path& path, uint64_t mebibytes) {
+    const std::string block(1U << 20U, 'x');
+    std::ofstream stream(path);
+    for (uint64_t count = 0; count < mebibytes; ++count) {
+        stream << block;
+    }
+    stream.close();
+    const int file = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (!stream || fsync(file) != 0) {
+        throw std::runtime_error("cannot write " + path.string());
+    }
+    close(file);
 }
 
-SwapFile::SwapFile(uint64_t bytes)
-    : _directory("/var/tmp"), _path(_directory / "swap"), _isUsed(useForSwap(_path, bytes)) {}
-
-SwapFile::~SwapFile() {
-    swapoff(_path.c_str());
+std::shared_ptr<const void> swapFile(uint64_t mebibytes) {
+    const auto directory = temporaryDirectory("/var/tmp");
+    const fs::path path = *directory / "swap";
+    writeCleanFile(path, mebibytes);
+    fs::permissions(path, fs::perms(0600));
+    const std::string makeSwap = "PATH=$PATH:/usr/sbin:/sbin mkswap '" + path.string() + "' >/dev/null 2>&1";
+    if (std::system(makeSwap.c_str()) != 0 || swapon(path.c_str(), 0) != 0) {
+        return nullptr;
+    }
+    return {directory.get(), [directory, path](const void*) { swapoff(path.c_str()); }};
 }
 
-HugePages::HugePages(uint64_t pages) : _before(hugePagesInPool()) {
-    setHugePagesInPool(_before + pages);
-    _areThere = hugePagesInPool() >= _before + pages;
-}
-
-HugePages::~HugePages() {
-    setHugePagesInPool(_before);
-}
-
-void writeCleanFile(const std::filesystem::path& path, uint64_t bytes) {
-    close(writeFile(path, bytes, S_IRUSR | S_IWUSR | S_IRGRP | S_IROTH));
+std::shared_ptr<const void> hugePages(uint64_t pages) {
+    static constexpr const char* kPool = "/proc/sys/vm/nr_hugepages";
+    uint64_t before = 0;
+    uint64_t now = 0;
+    std::ifstream(kPool) >> before;
+    std::ofstream(kPool) << before + pages;
+    std::ifstream(kPool) >> now;
+    const std::shared_ptr<const void> held(kPool, [before](const void*) { std::ofstream(kPool) << before; });
+    return now >= before + pages ? held : nullptr;
 }

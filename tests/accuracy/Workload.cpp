@@ -4,12 +4,11 @@
 #include <grp.h>
 #include <sys/personality.h>
 #include <sys/prctl.h>
+#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <array>
-#include <csignal>
-#include <cstdlib>
 #include <filesystem>
 #include <sstream>
 #include <stdexcept>
@@ -18,17 +17,9 @@ namespace {
 
 // The program lies next to the test. It is executed through a descriptor, since the user that it is to run
 // as may not reach its directory.
-int openProgram() {
+[[noreturn]] void runProgram(std::string scenario, const Workload::Conditions& conditions) {
     const auto path = std::filesystem::read_symlink("/proc/self/exe").replace_filename("accuracy_workload");
     const int program = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (program < 0) {
-        throw std::runtime_error("cannot open " + path.string());
-    }
-    return program;
-}
-
-[[noreturn]] void runProgram(int program, std::vector<std::string> texts,
-                             const Workload::Conditions& conditions) {
     setpgid(0, 0);
     if (!conditions.hasRandomAddresses) {
         personality(ADDR_NO_RANDOMIZE);
@@ -36,13 +27,9 @@ int openProgram() {
     if (conditions.user) {
         becomeUser(*conditions.user);
     }
-    std::vector<char*> arguments;
-    for (std::string& text : texts) {
-        arguments.push_back(text.data());
-    }
-    arguments.push_back(nullptr);
-    std::array<char*, 1> environment = {nullptr};
-    fexecve(program, arguments.data(), environment.data());
+    std::string name = "workload";
+    std::array<char*, 3> arguments = {name.data(), scenario.data(), nullptr};
+    fexecve(program, arguments.data(), arguments.data() + 2);
     _exit(1);
 }
 
@@ -55,28 +42,18 @@ void becomeUser(uid_t user) {
     }
 }
 
-Workload::Workload(const std::string& scenario, const std::vector<std::string>& arguments,
-                   Conditions conditions) {
-    std::vector<std::string> texts = {"workload", scenario};
-    texts.insert(texts.end(), arguments.begin(), arguments.end());
-    const int program = openProgram();
-    std::array<int, 2> reports = {};
-    std::array<int, 2> lifeline = {};
-    if (pipe2(reports.data(), O_CLOEXEC) != 0 || pipe2(lifeline.data(), O_CLOEXEC) != 0 ||
-        (_leader = fork()) < 0) {
+Workload::Workload(std::string scenario, const Conditions& conditions) {
+    std::array<int, 2> ends = {};
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends.data()) != 0 || (_leader = fork()) < 0) {
         throw std::runtime_error("cannot start a workload");
     }
     if (_leader == 0) {
-        dup2(lifeline[0], STDIN_FILENO);
-        dup2(reports[1], STDOUT_FILENO);
-        runProgram(program, std::move(texts), conditions);
+        dup2(ends[1], STDIN_FILENO);
+        dup2(ends[1], STDOUT_FILENO);
+        runProgram(std::move(scenario), conditions);
     }
-    setpgid(_leader, _leader);
-    close(program);
-    close(reports[1]);
-    close(lifeline[0]);
-    _reports = reports[0];
-    _lifeline = lifeline[1];
+    close(ends[1]);
+    _socket = ends[0];
     _readReports();
     if (_pids.empty()) {
         _end();
@@ -86,13 +63,10 @@ Workload::Workload(const std::string& scenario, const std::vector<std::string>& 
 
 void Workload::_readReports() {
     std::string text;
-    std::array<char, 4096> buffer = {};
-    while (!text.ends_with("ready\n")) {
-        const ssize_t count = read(_reports, buffer.data(), buffer.size());
-        if (count <= 0) {
+    for (char byte = 0; !text.ends_with("ready\n"); text += byte) {
+        if (read(_socket, &byte, 1) != 1) {
             return;
         }
-        text.append(buffer.data(), static_cast<size_t>(count));
     }
     std::istringstream words(text);
     std::string name;
@@ -108,12 +82,11 @@ Workload::~Workload() {
 
 // A process closes its files after it has given up its memory.
 void Workload::_end() {
-    close(_lifeline);
-    kill(-_leader, SIGKILL);
+    shutdown(_socket, SHUT_WR);
     char byte = 0;
-    while (read(_reports, &byte, 1) > 0) {
+    while (read(_socket, &byte, 1) > 0) {
     }
-    close(_reports);
+    close(_socket);
     waitpid(_leader, nullptr, 0);
 }
 
@@ -121,15 +94,6 @@ std::vector<pid_t> Workload::pids() const {
     std::vector<pid_t> pids;
     for (const auto& [name, pid] : _pids) {
         pids.push_back(pid);
-    }
-    return pids;
-}
-
-std::vector<pid_t> pidsOf(std::initializer_list<const Workload*> workloads) {
-    std::vector<pid_t> pids;
-    for (const Workload* workload : workloads) {
-        const auto more = workload->pids();
-        pids.insert(pids.end(), more.begin(), more.end());
     }
     return pids;
 }

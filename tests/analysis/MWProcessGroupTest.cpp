@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <list>
 #include <numeric>
 
@@ -14,12 +15,9 @@ TEST(MWProcessGroup, HoldsEachPidOnceWhateverTheOrder) {
     const FakeProcessSource sameAsA(3, "again");
     MWProcessGroupMinimal group;
     group.addProcess(a);
-    EXPECT_EQ(group.hashValue(), 19U * 37U ^ 3U);
     group.addProcess(b);
-    const uint64_t hash = group.hashValue();
-    EXPECT_EQ(hash, (19U * 37U ^ 3U) * 37U ^ static_cast<uint64_t>(int64_t{-7}));
     group.addProcess(sameAsA);
-    EXPECT_EQ(group.hashValue(), hash);
+    EXPECT_EQ(group.hashValue(), (19U * 37U ^ 3U) * 37U ^ static_cast<uint64_t>(int64_t{-7}));
     EXPECT_EQ(group.processes(), (MWProcessSet{&b, &a}));
     EXPECT_EQ(group.description(), "MWProcessGroup{MWProcess[-7], MWProcess[3]}");
 
@@ -36,13 +34,10 @@ TEST(MWProcessGroup, ImmutableCopiesAreEqualToMinimalGroupsAndToThemselvesAlone)
     MWProcessGroupMinimal minimal;
     minimal.addProcess(a);
     const auto group = minimal.immutableCopy();
-    const auto twin = minimal.immutableCopy();
     EXPECT_EQ(group->hash(), minimal.hash());
     EXPECT_TRUE(group->isEqual(minimal));
     EXPECT_TRUE(minimal.isEqual(*group));
-    EXPECT_TRUE(group->isEqual(*group));
-    EXPECT_FALSE(group->isEqual(*twin));
-
+    EXPECT_FALSE(group->isEqual(*minimal.immutableCopy()));
     minimal.addProcess(b);
     EXPECT_EQ(group->processes(), MWProcessSet{&a}) << "must not grow with the group it was copied from";
     EXPECT_DEATH(group->addProcess(b), "Attempt to add process to immutable MWProcessGroup");
@@ -59,35 +54,22 @@ TEST(MWProcessGroup, CachedTableIsGoneAfterTheCountedConsumptions) {
     EXPECT_DEATH(group.attachCachedCategories(table, 0), "");
 }
 
-namespace {
-
-template <typename Elements>
-std::vector<std::vector<int>> slicesOf(const Elements& elements, size_t batchSize) {
-    std::vector<std::vector<int>> slices;
-    mw_enumerateObjectsWithBatchSize(elements, batchSize, [&](const int* first, size_t count) {
-        slices.emplace_back(first, first + count);
-    });
-    return slices;
-}
-
-}  // namespace
-
 TEST(FastBatchEnumeration, HandsOutEveryElementOnceInOrder) {
-    std::vector<int> list(600);
-    std::iota(list.begin(), list.end(), 0);
-    const std::list<int> sequence(list.begin(), list.end());
-    for (const auto& slices : {slicesOf(list, 256), slicesOf(sequence, 256)}) {
-        ASSERT_EQ(slices.size(), 3U);
-        EXPECT_EQ(slices[0].size(), 256U);
-        EXPECT_EQ(slices[1].size(), 256U);
-        EXPECT_EQ(slices[2].size(), 88U);
+    const auto expectSlices = [](const auto& elements, size_t batchSize, const std::vector<size_t>& lengths) {
         std::vector<int> joined;
-        for (const auto& slice : slices) {
-            joined.insert(joined.end(), slice.begin(), slice.end());
-        }
-        EXPECT_EQ(joined, list);
-    }
-    EXPECT_EQ(slicesOf(std::vector{7, 8}, 0), (std::vector<std::vector<int>>{{7}, {8}}));
-    EXPECT_EQ(slicesOf(std::list{7, 8}, 0), (std::vector<std::vector<int>>{{7}, {8}}));
-    EXPECT_TRUE(slicesOf(std::vector<int>{}, 4).empty());
+        std::vector<size_t> handedOut;
+        mw_enumerateObjectsWithBatchSize(elements, batchSize, [&](const int* first, size_t count) {
+            joined.insert(joined.end(), first, first + count);
+            handedOut.push_back(count);
+        });
+        EXPECT_EQ(handedOut, lengths);
+        EXPECT_TRUE(std::ranges::equal(joined, elements));
+    };
+    std::vector<int> array(600);
+    std::iota(array.begin(), array.end(), 0);
+    expectSlices(array, 256, {256, 256, 88});
+    expectSlices(std::list<int>(array.begin(), array.end()), 256, {256, 256, 88});
+    expectSlices(std::vector{7, 8}, 0, {1, 1});
+    expectSlices(std::list{7, 8}, 0, {1, 1});
+    expectSlices(std::vector<int>{}, 4, {});
 }

@@ -1,12 +1,13 @@
 #pragma once
 
 #include <string>
+#include <utility>
 #include <vector>
 
 /// An argument vector as the program's entry gets it: the program's name first, writable, NULL at the end.
 class CommandLine {
 public:
-    CommandLine(std::initializer_list<std::string> arguments) : _arguments(arguments) {
+    explicit CommandLine(std::vector<std::string> arguments) : _arguments(std::move(arguments)) {
         _arguments.insert(_arguments.begin(), "memweight");
         for (auto& argument : _arguments) {
             _pointers.push_back(argument.data());

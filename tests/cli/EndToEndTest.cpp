@@ -9,10 +9,10 @@
 #include <cstdio>
 #include <cstdlib>
 #include <map>
+#include <regex>
 #include <sstream>
 #include <string>
 #include <utility>
-#include <vector>
 
 #include "support/ChildProcess.h"
 
@@ -22,81 +22,49 @@ namespace {
 
 constexpr uint64_t kPage = 4096;
 
-struct Row {
-    uint64_t dirty = 0;
-    uint64_t clean = 0;
-    uint64_t reclaimable = 0;
-    uint64_t regions = 0;
-};
-
-/// One category table, and the line above it ("" for a process's own memory).
-struct Table {
-    std::string title;
-    std::map<std::string, Row> rows;
-};
+/// Dirty, clean and reclaimable bytes, and regions.
+using Row = std::array<uint64_t, 4>;
 
 struct Report {
     int status = -1;
     std::string text;
-    std::vector<Table> tables;
+    /// Each category table by the line above it, which is "" for a process's own memory.
+    std::map<std::string, std::map<std::string, Row>> tables;
 
-    /// The first table whose title begins so; an empty one when there is none.
-    Table table(const std::string& title) const {
-        for (const Table& candidate : tables) {
-            if (candidate.title.starts_with(title)) {
-                return candidate;
-            }
-        }
-        return {};
+    uint64_t dirty(const std::string& title, const std::string& category) const {
+        return tables.at(title).at(category)[0];
     }
+    bool contains(const std::string& part) const { return text.find(part) != std::string::npos; }
 };
 
-bool readSize(std::istringstream& line, uint64_t& bytes) {
-    std::string unit;
-    return line >> bytes >> unit && unit == "B";
-}
+const std::string kSummary = "Summary Memweight";
 
-/// "   DIRTY B   CLEAN B   RECLAIMABLE B   REGIONS    CATEGORY"
-bool readRow(const std::string& text, Row& row, std::string& category) {
-    std::istringstream line(text);
-    if (!readSize(line, row.dirty) || !readSize(line, row.clean) || !readSize(line, row.reclaimable) ||
-        !(line >> row.regions >> std::ws)) {
-        return false;
-    }
-    return static_cast<bool>(std::getline(line, category));
-}
-
-// The parts sum to the whole, whatever the report is about.
-void expectTotal(const Table& table, const Row& total) {
-    Row sum;
-    for (const auto& [category, row] : table.rows) {
-        sum = {sum.dirty + row.dirty, sum.clean + row.clean, sum.reclaimable + row.reclaimable,
-               sum.regions + row.regions};
-    }
-    EXPECT_EQ(sum.dirty, total.dirty) << table.title;
-    EXPECT_EQ(sum.clean, total.clean) << table.title;
-    EXPECT_EQ(sum.reclaimable, total.reclaimable) << table.title;
-    EXPECT_EQ(sum.regions, total.regions) << table.title;
-}
-
-std::vector<Table> parseTables(const std::string& text) {
-    std::vector<Table> tables;
-    Table table;
-    std::istringstream lines(text);
-    std::string line;
-    while (std::getline(lines, line)) {
-        Row row;
-        std::string category;
-        if (line.starts_with("Shared with") || line.starts_with("Summary Memweight")) {
-            table.title = line;
-        } else if (readRow(line, row, category) && category != "TOTAL") {
-            table.rows[category] = row;
-        } else if (category == "TOTAL") {
-            expectTotal(table, row);
-            tables.push_back(std::exchange(table, {}));
+/// The tables of a report; the rows of each must sum to its total.
+void readTables(Report& report) {
+    static const std::regex kRow(R"(\s*(\d+) B\s+(\d+) B\s+(\d+) B\s+(\d+)\s+(.*))");
+    std::istringstream lines(report.text);
+    std::string title;
+    std::map<std::string, Row> rows;
+    Row sum = {};
+    for (std::string line; std::getline(lines, line);) {
+        std::smatch cells;
+        if (line.starts_with("Shared with") || line.starts_with(kSummary)) {
+            title = line.starts_with(kSummary) ? kSummary : line;
+        } else if (std::regex_match(line, cells, kRow)) {
+            const bool isTotal = cells[5] == "TOTAL";
+            Row row;
+            for (size_t column = 0; column < row.size(); ++column) {
+                row[column] = std::stoull(cells[column + 1]);
+                sum[column] += isTotal ? 0 : row[column];
+            }
+            if (!isTotal) {
+                rows[cells[5]] = row;
+                continue;
+            }
+            EXPECT_EQ(std::exchange(sum, {}), row) << report.text;
+            report.tables[std::exchange(title, {})] = std::exchange(rows, {});
         }
     }
-    return tables;
 }
 
 /// Runs the tool with sizes in bytes; standard error comes into the text too.
@@ -112,26 +80,22 @@ Report memweight(const std::string& arguments, const std::string& prefix = "") {
         report.text.append(buffer.data(), count);
     }
     report.status = WEXITSTATUS(pclose(output));
-    report.tables = parseTables(report.text);
+    readTables(report);
     return report;
 }
 
-void touchPages(int memfd, size_t first, size_t count) {
+uint64_t touchPages(int memfd, size_t first, size_t count) {
     auto* pages = static_cast<char*>(mmap(nullptr, 64 * kPage, PROT_READ | PROT_WRITE, MAP_SHARED, memfd, 0));
     for (size_t page = first; page < first + count; ++page) {
         pages[page * kPage] = 1;
     }
+    return 0;
 }
 
 TEST(EndToEnd, SharedMemoryIsCountedOnceAndNamed) {
     const int memfd = memfd_create("end-to-end", 0);
     ASSERT_EQ(ftruncate(memfd, 64 * kPage), 0);
-    const auto toucher = [=](size_t first) {
-        return [=] {
-            touchPages(memfd, first, 30);
-            return uint64_t{0};
-        };
-    };
+    const auto toucher = [=](size_t first) { return [=] { return touchPages(memfd, first, 30); }; };
     const ChildProcess low(toucher(0));
     const ChildProcess high(toucher(20));
     close(memfd);
@@ -139,11 +103,10 @@ TEST(EndToEnd, SharedMemoryIsCountedOnceAndNamed) {
     ASSERT_EQ(report.status, 0) << report.text;
 
     const std::string category = "shared memory (memfd)";
-    const std::string name = "cli_tests [" + std::to_string(low.pid()) + "]";
-    const Table sharedWithLow = report.table("Shared with " + name + ":");
-    ASSERT_TRUE(sharedWithLow.rows.contains(category)) << report.text;
-    EXPECT_EQ(sharedWithLow.rows.at(category).dirty, 30 * kPage) << "what one process has touched of it";
-    EXPECT_EQ(report.table("Summary").rows.at(category).dirty, 50 * kPage) << "both together, once";
+    const std::string others = "Shared with cli_tests [" + std::to_string(low.pid()) + "]:";
+    ASSERT_TRUE(report.contains("\n" + others + "\n")) << report.text;
+    EXPECT_EQ(report.dirty(others, category), 30 * kPage) << "what one process has touched of it";
+    EXPECT_EQ(report.dirty(kSummary, category), 50 * kPage) << "both together, once";
 }
 
 TEST(EndToEnd, OneProcessAloneIsOneTable) {
@@ -158,12 +121,12 @@ TEST(EndToEnd, OneProcessAloneIsOneTable) {
     const Report report = memweight("--pid " + std::to_string(child.pid()));
     ASSERT_EQ(report.status, 0) << report.text;
     ASSERT_EQ(report.tables.size(), 1U) << "no summary of a single process";
-    EXPECT_EQ(report.tables[0].rows.at("shared anonymous memory").dirty, 34 * kPage);
+    EXPECT_EQ(report.dirty("", "shared anonymous memory"), 34 * kPage);
     uint64_t dirty = 0;
-    for (const auto& [category, row] : report.tables[0].rows) {
-        dirty += row.dirty;
+    for (const auto& [category, row] : report.tables.at("")) {
+        dirty += row[0];
     }
-    EXPECT_NE(report.text.find("\tMemweight: " + std::to_string(dirty) + " B ("), std::string::npos)
+    EXPECT_TRUE(report.contains("\tMemweight: " + std::to_string(dirty) + " B ("))
         << "the charge is the sum of its table";
 }
 
@@ -182,11 +145,11 @@ TEST(EndToEnd, ChildrenAreTargetsWithTheirParent) {
     const std::string grandchild = std::to_string(child.answer());
     const Report both = memweight("-t --pid " + pid);
     EXPECT_EQ(both.status, 0);
-    EXPECT_NE(both.text.find("[" + grandchild + "]: 64-bit"), std::string::npos) << both.text;
+    EXPECT_TRUE(both.contains("[" + grandchild + "]: 64-bit")) << both.text;
     const Report without = memweight("-t --pid " + pid + " -x " + grandchild);
     EXPECT_EQ(without.status, 0);
-    EXPECT_NE(without.text.find("[" + pid + "]: 64-bit"), std::string::npos) << without.text;
-    EXPECT_EQ(without.text.find("[" + grandchild + "]"), std::string::npos) << without.text;
+    EXPECT_TRUE(without.contains("[" + pid + "]: 64-bit")) << without.text;
+    EXPECT_FALSE(without.contains("[" + grandchild + "]")) << without.text;
     kill(static_cast<pid_t>(child.answer()), SIGKILL);
 }
 
@@ -197,15 +160,14 @@ TEST(EndToEnd, FormsOfTheReport) {
     EXPECT_EQ(wide.status, 0);
     EXPECT_TRUE(wide.text.starts_with(std::string(90, '=') + "\n")) << wide.text;
     EXPECT_LT(wide.text.find(" __DATA"), wide.text.find(" stack")) << "in the order of the names";
-    EXPECT_NE(memweight("-f pages --sort clean " + pid).text.find(" pages (4096 bytes per page)"),
-              std::string::npos);
+    EXPECT_TRUE(memweight("-f pages --sort clean " + pid).contains(" pages (4096 bytes per page)"));
     const Report named = memweight("-s cli_tests");
     EXPECT_EQ(named.status, 0);
-    EXPECT_NE(named.text.find("cli_tests [" + pid + "]: 64-bit"), std::string::npos) << named.text;
+    EXPECT_TRUE(named.contains("cli_tests [" + pid + "]: 64-bit")) << named.text;
     if (geteuid() == 0) {
         const Report all = memweight("-a");
         EXPECT_EQ(all.status, 0);
-        EXPECT_FALSE(all.table("Summary").rows.empty()) << all.text;
+        EXPECT_TRUE(all.tables.contains(kSummary)) << all.text;
         EXPECT_EQ(memweight("--unmapped " + pid).status, 0);
     }
 }

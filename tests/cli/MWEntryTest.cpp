@@ -4,12 +4,14 @@
 #include <unistd.h>
 
 #include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <mutex>
 #include <thread>
 
 #include "analysis/MWMemweight.h"
 #include "cli/CommandLine.h"
-#include "cli/MWUsage.h"
 #include "support/FakeHost.h"
 
 namespace {
@@ -28,21 +30,17 @@ Run capture(Work work) {
     return {status, testing::internal::GetCapturedStdout(), testing::internal::GetCapturedStderr()};
 }
 
-Run run(std::initializer_list<std::string> arguments) {
+Run run(const std::vector<std::string>& arguments) {
     const CommandLine line(arguments);
     return capture([&] { return MWMemweightMain(line.argc(), line.argv()); });
 }
 
 /// A process of one region: four private pages, all dirty.
 FakeProcess processOfFourPages(const std::string& executable) {
-    FakeRegion region = {.start = 0x10000, .size = 4 * 4096};
-    region.info.share_mode = SM_PRIVATE;
-    region.info.pages_resident = 4;
-    region.info.pages_dirtied = 4;
-    region.info.object_id_full = 77;
-    FakeProcess process = {.executable = executable};
-    process.regions = {region};
-    return process;
+    return {.executable = executable,
+            .regions = {{.start = 0x10000,
+                         .size = 4 * 4096,
+                         .info = {.pages_resident = 4, .pages_dirtied = 4, .share_mode = SM_PRIVATE}}}};
 }
 
 /// A system on which the user interrupts the tool twice before it has read the first process.
@@ -71,104 +69,69 @@ private:
     std::once_flag _interrupted;
 };
 
-constexpr const char* kNoProcesses =
-    "Unable to find any processes matching the supplied process names or pids (try as root?)\n";
-
 }  // namespace
 
-TEST(MWUsage, IsThisText) {
-    EXPECT_EQ(
-        MWUsageText(),
-        "Gather memory information about a process or set of processes\n"
-        "Usage: memweight [args] [proc/pid/heapsnap [proc/pid/heapsnap [...]]]\n"
-        "    -a, --all                             target all processes\n"
-        "    -j, --json <file>                     print json output to a file\n"
-        "    -h, --help                            print this output\n"
-        "    -p, --proc, --pid [proc/pid]          target pid or process (or interpret for -p)\n"
-        "    -x, --exclude [proc/pid]              exclude pid or process\n"
-        "    -s, --skip                            skip processes that are idle-exit clean\n"
-        "    -v                                    print all regions and spanlist-like output of address "
-        "space layout (default output is a summary)\n"
-        "    -f, --format (bytes|formatted|pages)  change size formatting preference (default: formatted)\n"
-        "    --sort <column>                       change the column used for sorting (default: dirty)\n"
-        "    -w, --wide                            show wide output with all columns and full paths "
-        "(implies --swapped --wired)\n"
-        "    --swapped                             show swapped/compressed column\n"
-        "    --wired                               show wired column\n"
-        "    --vmObjectDirty                       interpret dirty memory as viewed by VM objects in the "
-        "kernel\n"
-        "    --unmapped                            search all processes for unmapped memory owned by the "
-        "target processes\n"
-        "    --sample <interval>                   repeatedly gather memweight at the given sampling "
-        "interval in seconds (can be fractional \xE2\x80\x94 e.g. 0.5)\n");
-}
-
-TEST(MWEntry, HelpAndRefusedArgumentsPrintTheUsageOnStandardOutput) {
+TEST(MWEntry, RefusedArgumentsPrintTheUsageOnStandardOutput) {
+    std::ifstream file(std::filesystem::path(__FILE__).replace_filename("usage.txt"));
+    const std::string usage{std::istreambuf_iterator<char>(file), {}};
     const FakeHost host;
-    const auto help = run({"-w", "-h"});
-    EXPECT_EQ(help.status, 0);
-    EXPECT_EQ(help.output, MWUsageText());
-    EXPECT_EQ(help.errors, "");
-
-    const auto format = run({"-f", "kb"});
-    EXPECT_EQ(format.status, 1);
-    EXPECT_EQ(format.output, MWUsageText());
-    EXPECT_EQ(format.errors,
-              "Unrecognized argument to -f / --format.\n"
-              "Accepted arguments: 'bytes', 'formatted', 'pages'.\n");
-
-    const auto unknown = run({"--nonsense"});
-    EXPECT_EQ(unknown.status, 1);
-    EXPECT_EQ(unknown.output, MWUsageText());
-    EXPECT_EQ(unknown.errors, "memweight: unrecognized option '--nonsense'\n");
+    struct Case {
+        std::vector<std::string> arguments;
+        int status;
+        std::string errors;
+    };
+    const std::vector<Case> cases = {
+        {{"-w", "-h"}, 0, ""},
+        {{"-f", "kb"},
+         1,
+         "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.\n"},
+        {{"--nonsense"}, 1, "memweight: unrecognized option '--nonsense'\n"},
+        {{}, 1, "Must specify at least one process or heapsnap\n"},
+    };
+    for (const Case& c : cases) {
+        const auto refused = run(c.arguments);
+        EXPECT_EQ(refused.status, c.status);
+        EXPECT_EQ(refused.output, usage);
+        EXPECT_EQ(refused.errors, c.errors);
+    }
 }
 
-TEST(MWEntry, OptionsThatAreNotBuiltEndTheRunBeforeAnythingIsTouched) {
-    FakeHost host;
-    const auto json = run({"nosuch", "-j", "/dev/null", "-v"});
-    EXPECT_EQ(json.status, 1);
-    EXPECT_EQ(json.output, "");
-    EXPECT_EQ(json.errors, "memweight: --json is not built yet\nmemweight: -v is not built yet\n");
-    EXPECT_EQ(run({"--sample", "1", "--statpack", "a.spj", "1"}).errors,
-              "memweight: --statpack is not built yet\nmemweight: --sample is not built yet\n");
-    EXPECT_TRUE(host.unlinked.empty());
-    EXPECT_EQ(host.asked("proc_pidinfo.full"), 0);
-}
-
-TEST(MWEntry, SystemWideOptionsNeedRoot) {
+TEST(MWEntry, RefusesBeforeAnythingIsTouched) {
     FakeHost host;
     host.processes[5] = processOfFourPages("/bin/five");
     host.effectiveUser = 1000;
-    for (const auto& refused : {run({"-a"}), run({"--unmapped", "five"})}) {
+    const std::vector<std::pair<std::vector<std::string>, std::string>> cases = {
+        {{"nosuch", "-j", "/dev/null", "-v"},
+         "memweight: --json is not built yet\nmemweight: -v is not built yet\n"},
+        {{"--sample", "1", "--statpack", "a.spj", "1"},
+         "memweight: --statpack is not built yet\nmemweight: --sample is not built yet\n"},
+        {{"-a"}, "Must run as root.\n"},
+        {{"--unmapped", "five"}, "Must run as root.\n"},
+    };
+    for (const auto& [arguments, errors] : cases) {
+        const auto refused = run(arguments);
         EXPECT_EQ(refused.status, 1);
         EXPECT_EQ(refused.output, "");
-        EXPECT_EQ(refused.errors, "Must run as root.\n");
+        EXPECT_EQ(refused.errors, errors);
     }
-    EXPECT_EQ(host.asked("task_read_for_pid"), 0);
-    EXPECT_EQ(run({"five"}).status, 0);
+    EXPECT_TRUE(host.unlinked.empty());
+    EXPECT_EQ(host.asked("proc_pidinfo.full") + host.asked("task_read_for_pid"), 0);
     // The conflicting mode takes --unmapped away, and with it the need for root.
     EXPECT_EQ(run({"--unmapped", "--vmObjectDirty", "five"}).status, 0);
 }
 
 TEST(MWEntry, ARunWithoutTargetsSaysSoAndRemovesItsOutputFiles) {
     FakeHost host;
-    host.processes[5] = processOfFourPages("/bin/five");
-    EXPECT_EQ(run({"nosuch"}).errors, kNoProcesses);
-    EXPECT_EQ(run({"--pid", "777"}).errors,
-              std::string("Unable to analyze process with pid 777 (try as root?)\n") + kNoProcesses);
-
-    const auto nothing = run({});
-    EXPECT_EQ(nothing.status, 1);
-    EXPECT_EQ(nothing.output, MWUsageText());
-    EXPECT_EQ(nothing.errors, "Must specify at least one process or heapsnap\n");
-
     MWMemweightArgs args;
-    args.setPotentialTargetProcesses({"nosuch"});
+    args.setTargetPids({{777, std::nullopt}});
     args.setJSONOutputFile("a.json");
     args.setStatpackOutputFile("a.spj");
-    const auto withFiles = capture([&] { return MWRunMemweight(args); });
-    EXPECT_EQ(withFiles.status, 1);
-    EXPECT_EQ(withFiles.output, "");
+    const auto none = capture([&] { return MWRunMemweight(args); });
+    EXPECT_EQ(none.status, 1);
+    EXPECT_EQ(none.output, "");
+    EXPECT_EQ(none.errors,
+              "Unable to analyze process with pid 777 (try as root?)\n"
+              "Unable to find any processes matching the supplied process names or pids (try as root?)\n");
     EXPECT_EQ(host.unlinked, (std::vector<std::string>{"a.json", "a.spj"}));
 }
 
@@ -181,15 +144,10 @@ TEST(MWEntry, OneMeasurementReportsWhatWasFoundAndNamesWhatWasNot) {
     EXPECT_NE(report.output.find("five [5]"), std::string::npos) << report.output;
     EXPECT_NE(report.output.find("16384"), std::string::npos) << report.output;
     EXPECT_TRUE(host.openTasks.empty());
-}
-
-TEST(MWEntry, TheBreakdownModeIsSwitchedOnUnlessObjectsAreAskedFor) {
-    FakeHost host;
-    host.processes[5] = processOfFourPages("/bin/five");
+    EXPECT_EQ(host.selfRegionMemweight, 1) << "broken down";
+    host.selfRegionMemweight = 0;
     run({"--vmObjectDirty", "five"});
     EXPECT_EQ(host.selfRegionMemweight, 0);
-    run({"five"});
-    EXPECT_EQ(host.selfRegionMemweight, 1);
 }
 
 TEST(MWEntry, AnInterruptEndsTheGatheringButNotTheReport) {
@@ -202,12 +160,10 @@ TEST(MWEntry, AnInterruptEndsTheGatheringButNotTheReport) {
     const auto report = run({"-f", "bytes", "many"});
     EXPECT_EQ(report.status, 0);
     EXPECT_EQ(report.errors, "Exiting early due to SIGINT\nExiting early due to SIGINT\n");
-    const auto contains = [&](const std::string& text) {
-        return report.output.find(text) != std::string::npos;
-    };
-    EXPECT_TRUE(contains("many [" + std::to_string(highest) + "]")) << report.output;
-    EXPECT_TRUE(contains("16384")) << report.output;
-    EXPECT_TRUE(contains("Memweight exited early due to SIGINT")) << report.output;
+    for (const std::string& text : {"many [" + std::to_string(highest) + "]", std::string("16384"),
+                                    std::string("Memweight exited early due to SIGINT")}) {
+        EXPECT_NE(report.output.find(text), std::string::npos) << text << " in " << report.output;
+    }
 }
 
 TEST(MWEntryDeathTest, AnInterruptEndsARunThatWritesToATerminal) {

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include "cli/CommandLine.h"
 #include "cli/MWMemweightArgs.h"
 #include "support/FakeHost.h"
 
@@ -9,23 +10,28 @@ using Pids = std::vector<int64_t>;
 
 /// 1 init ── 10 server ─┬─ 11 worker ── 13 helper
 ///           20 shell ──┤  12 worker
-///                      └─ 21 memweight (the tool itself) ── 22 pager
-void addFamily(FakeHost& host) {
-    host.processes[1] = {.parent = 0, .executable = "/sbin/init"};
-    host.processes[10] = {.parent = 1, .executable = "/usr/bin/server"};
-    host.processes[11] = {.parent = 10, .executable = "/usr/bin/worker"};
-    host.processes[12] = {.parent = 10, .executable = "/usr/bin/worker"};
-    host.processes[13] = {.parent = 11, .executable = "/usr/bin/helper"};
-    host.processes[20] = {.parent = 1, .executable = "/bin/shell"};
-    host.processes[21] = {.parent = 20, .executable = "/usr/bin/memweight"};
-    host.processes[22] = {.parent = 21, .executable = "/usr/bin/pager"};
-    host.ownPid = 21;
-}
+///                      └─ 21 memweight (the tool itself) ── 22 pager (clean, and may exit when idle)
+class FamilyHost : public FakeHost {
+public:
+    FamilyHost() {
+        processes[0] = {.parent = 0, .name = "kernel", .flags = PROC_FLAG_SYSTEM};
+        processes[1] = {.parent = 0, .executable = "/sbin/init"};
+        processes[10] = {.parent = 1, .executable = "/usr/bin/server"};
+        processes[11] = {.parent = 10, .executable = "/usr/bin/worker"};
+        processes[12] = {.parent = 10, .executable = "/usr/bin/worker"};
+        processes[13] = {.parent = 11, .executable = "/usr/bin/helper"};
+        processes[20] = {.parent = 1, .executable = "/bin/shell"};
+        processes[21] = {.parent = 20, .executable = "/usr/bin/memweight"};
+        processes[22] = {.parent = 21,
+                         .executable = "/usr/bin/pager",
+                         .dirtyFlags = PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT};
+        ownPid = 21;
+    }
+};
 
-MWMemweightArgs targeting(std::set<std::string> descriptions) {
-    MWMemweightArgs args;
-    args.setPotentialTargetProcesses(std::move(descriptions));
-    return args;
+MWMemweightArgs parsed(const std::vector<std::string>& arguments) {
+    const CommandLine line(arguments);
+    return MWMemweightArgs::initWithArgc(line.argc(), line.argv()).value();
 }
 
 struct Resolved {
@@ -53,124 +59,80 @@ Resolved resolve(MWMemweightArgs& args) {
     return result;
 }
 
-Resolved resolve(MWMemweightArgs&& args) {
-    return resolve(args);
+struct Case {
+    std::vector<std::string> arguments;
+    std::optional<Pids> pids = {};
+    std::string error = {};
+    std::string standardError = {};
+    std::set<int32_t> refused = {};
+    bool listFails = false;
+    std::set<std::string> files = {};
+};
+
+void expectResolutions(const std::vector<Case>& cases) {
+    for (const Case& c : cases) {
+        FamilyHost host;
+        for (const int32_t pid : c.refused) {
+            host.processes[pid].refused = true;
+        }
+        host.processListFails = c.listFails;
+        host.files = c.files;
+        MWMemweightArgs args = parsed(c.arguments);
+        const Resolved found = resolve(args);
+        const std::string arguments = testing::PrintToString(c.arguments);
+        EXPECT_EQ(found.pids, c.pids) << arguments;
+        EXPECT_EQ(found.error, c.error) << arguments;
+        EXPECT_EQ(found.standardError, c.standardError) << arguments;
+    }
 }
 
 }  // namespace
 
-TEST(MWTargetResolution, NamesAndPidsBecomeProcesses) {
-    FakeHost host;
-    addFamily(host);
-    MWMemweightArgs args = targeting({"worker", "20"});
-    args.setTargetPids({{1, std::nullopt}});
-    const auto found = resolve(args);
-    EXPECT_EQ(found.pids, (Pids{1, 11, 12, 20}));
-    EXPECT_EQ(found.error, "");
-    EXPECT_EQ(args.targetPids(),
-              (MWPidMap{{1, std::nullopt}, {11, "worker"}, {12, "worker"}, {20, std::nullopt}}));
-    EXPECT_FALSE(found.resolution.targets->at(11)->hiddenFromDisplay());
+TEST(MWTargetResolution, TakesWhatIsNamedButForTheExcluded) {
+    expectResolutions({
+        {{"worker", "20", "--pid", "1"}, Pids{1, 11, 12, 20}},
+        {{"worker", "shell", "memweight", "-x", "12", "-x", "shell", "-x", "nosuch"}, Pids{11}},
+        {{"-s", "worker", "pager"}, Pids{11, 12}},
+        // A descendant is known by its pid alone.
+        {.arguments = {"--targetChildren", "server", "shell", "-x", "12"},
+         .pids = Pids{10, 11, 20, 22},
+         .standardError = "Unable to analyze process with pid 13 (try as root?)\n",
+         .refused = {13}},
+        {.arguments = {"-a", "nosuch", "-x", "worker"}, .pids = Pids{1, 13, 20, 22}, .refused = {10}},
+        // One process only for a name that is also a file's.
+        {.arguments = {"worker", "shell"}, .pids = Pids{11, 20}, .files = {"worker"}},
+        {{"0", "shell", "-x", "kernel"}, Pids{20}},
+    });
 }
 
-TEST(MWTargetResolution, WhatMatchesNothingIsToldBesideTheMap) {
-    FakeHost host;
-    addFamily(host);
-    const auto some = resolve(targeting({"Worker", "server", "work"}));
-    EXPECT_EQ(some.pids, Pids{10});
-    EXPECT_EQ(some.error,
-              "4: Unable to find pid for process matching 'Worker'\n"
-              "Unable to find pid for process matching 'work'");
-    const auto none = resolve(targeting({"777"}));
-    EXPECT_EQ(none.pids, Pids{});
-    EXPECT_EQ(none.error, "4: Unable to find pid for process matching '777'");
-    EXPECT_EQ(none.standardError, "");
-}
-
-TEST(MWTargetResolution, NothingToTargetFails) {
-    const FakeHost host;
-    const auto nothing = resolve(MWMemweightArgs());
-    EXPECT_FALSE(nothing.pids);
-    EXPECT_EQ(nothing.error, "8: Must specify at least one process or heapsnap");
-}
-
-TEST(MWTargetResolution, AnUnreadableProcessListLeavesThePidsGivenAsNumbers) {
-    FakeHost host;
-    addFamily(host);
-    host.processListFails = true;
-    MWMemweightArgs args = targeting({"worker"});
-    args.setTargetPids({{20, std::nullopt}});
-    const auto found = resolve(args);
-    EXPECT_EQ(found.pids, Pids{20});
-    EXPECT_EQ(found.error, "4: Unable to obtain system process list");
-
-    MWMemweightArgs all;
-    all.setTargetAll(true);
-    const auto none = resolve(all);
-    EXPECT_FALSE(none.pids);
-    EXPECT_EQ(none.error, "");
-}
-
-TEST(MWTargetResolution, ProcessesThatCannotBeReadAreNamedAndSkipped) {
-    FakeHost host;
-    addFamily(host);
-    host.processes[12].refused = true;
-    MWMemweightArgs args = targeting({"worker"});
-    args.setTargetPids({{777, std::nullopt}});
-    const auto found = resolve(args);
-    EXPECT_EQ(found.pids, Pids{11});
-    EXPECT_EQ(found.standardError,
-              "Unable to analyze process worker [12] (try as root?)\n"
-              "Unable to analyze process with pid 777 (try as root?)\n");
-}
-
-TEST(MWTargetResolution, ExclusionsHoldAndUnknownOnesAreIgnored) {
-    FakeHost host;
-    addFamily(host);
-    MWMemweightArgs args = targeting({"worker", "shell", "memweight"});
-    args.setExcludedPidsOrProcesses({"12", "shell", "nosuch"});
-    const auto found = resolve(args);
-    EXPECT_EQ(found.pids, Pids{11});
-    EXPECT_EQ(found.error, "");
-
-    MWMemweightArgs self = targeting({"memweight"});
-    self.setExcludeSelf(false);
-    EXPECT_EQ(resolve(self).pids, Pids{21});
-}
-
-TEST(MWTargetResolution, ChildrenAreTargetsButForExcludedOnesAndTheToolItself) {
-    FakeHost host;
-    addFamily(host);
-    host.processes[13].refused = true;
-    MWMemweightArgs args = targeting({"server", "shell"});
-    args.setTargetChildren(true);
-    args.setExcludedPidsOrProcesses({"12"});
-    const auto found = resolve(args);
-    EXPECT_EQ(found.pids, (Pids{10, 11, 20, 22}));
-    // No name: a descendant is known by its pid alone.
-    EXPECT_EQ(found.standardError, "Unable to analyze process with pid 13 (try as root?)\n");
-    EXPECT_EQ(args.targetPids().at(10), std::nullopt);
-}
-
-TEST(MWTargetResolution, AllTakesEveryReadableProcessButTheExcluded) {
-    FakeHost host;
-    addFamily(host);
-    host.processes[10].refused = true;
-    MWMemweightArgs args = targeting({"nosuch"});
-    args.setTargetAll(true);
-    args.setExcludedPidsOrProcesses({"worker"});
-    const auto found = resolve(args);
-    EXPECT_EQ(found.pids, (Pids{1, 13, 20, 22}));
-    EXPECT_EQ(found.error, "");
-    EXPECT_EQ(found.standardError, "");
+TEST(MWTargetResolution, TellsWhatItCannotTake) {
+    expectResolutions({
+        {{"Worker", "server", "work"},
+         Pids{10},
+         "4: Unable to find pid for process matching 'Worker'\n"
+         "Unable to find pid for process matching 'work'"},
+        {{"777"}, Pids{}, "4: Unable to find pid for process matching '777'"},
+        {{}, {}, "8: Must specify at least one process or heapsnap"},
+        {.arguments = {"worker", "--pid", "20"},
+         .pids = Pids{20},
+         .error = "4: Unable to obtain system process list",
+         .listFails = true},
+        {.arguments = {"-a"}, .listFails = true},
+        {.arguments = {"worker", "--pid", "777"},
+         .pids = Pids{11},
+         .standardError = "Unable to analyze process worker [12] (try as root?)\n"
+                          "Unable to analyze process with pid 777 (try as root?)\n",
+         .refused = {12}},
+        {.arguments = {"/tmp", "shell"},
+         .error = "7: Error opening heapsnap /tmp: reading heapsnap files is not built yet",
+         .files = {"/tmp"}},
+        {{"0", "shell"}, {}, "10: Measuring the kernel (pid 0) is not built yet"},
+    });
 }
 
 TEST(MWTargetResolution, UnmappedAddsAllOtherProcessesHidden) {
-    FakeHost host;
-    addFamily(host);
-    host.processes[0] = {.parent = 0, .name = "kernel", .flags = PROC_FLAG_SYSTEM};
-    MWMemweightArgs args = targeting({"worker"});
-    args.setSearchForUnmapped(true);
-    args.setExcludedPidsOrProcesses({"shell"});
+    const FamilyHost host;
+    MWMemweightArgs args = parsed({"worker", "--unmapped", "-x", "shell"});
     const auto found = resolve(args);
     EXPECT_EQ(found.pids, (Pids{1, 10, 11, 12, 13, 22}));
     for (const auto& [pid, process] : *found.resolution.targets) {
@@ -178,51 +140,15 @@ TEST(MWTargetResolution, UnmappedAddsAllOtherProcessesHidden) {
     }
 }
 
-TEST(MWTargetResolution, SkipDropsIdleExitCleanProcesses) {
-    FakeHost host;
-    addFamily(host);
-    host.processes[11].dirtyFlags = PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT;
-    MWMemweightArgs args = targeting({"worker"});
-    EXPECT_EQ(resolve(args).pids, (Pids{11, 12}));
-    args.setSkipIdleExitClean(true);
-    EXPECT_EQ(resolve(args).pids, Pids{12});
-}
-
-TEST(MWTargetResolution, AFileIsMeantUnlessItBearsTheNameOfAProcess) {
-    FakeHost host;
-    addFamily(host);
-    host.files = {"worker", "/tmp"};
-    MWMemweightArgs args = targeting({"worker", "shell"});
-    EXPECT_EQ(resolve(args).pids, (Pids{11, 20}));  // one process only for a name that is also a file's
-    EXPECT_EQ(args.potentialTargetProcesses(), std::set<std::string>{"shell"});
-
-    const auto directory = resolve(targeting({"/tmp", "shell"}));
-    EXPECT_FALSE(directory.pids);
-    EXPECT_EQ(directory.error, "7: Error opening heapsnap /tmp: reading heapsnap files is not built yet");
-}
-
-TEST(MWTargetResolution, TheKernelIsRefusedUnlessExcluded) {
-    FakeHost host;
-    addFamily(host);
-    host.processes[0] = {.parent = 0, .name = "kernel", .flags = PROC_FLAG_SYSTEM};
-    const auto kernel = resolve(targeting({"0", "shell"}));
-    EXPECT_FALSE(kernel.pids);
-    EXPECT_EQ(kernel.error, "10: Measuring the kernel (pid 0) is not built yet");
-
-    MWMemweightArgs without = targeting({"0", "shell"});
-    without.setExcludedPidsOrProcesses({"kernel"});
-    EXPECT_EQ(resolve(without).pids, Pids{20});
-}
-
 TEST(MWTargetResolution, ResolvingAgainFindsNewProcessesAndKeepsFormerPids) {
-    FakeHost host;
-    addFamily(host);
-    MWMemweightArgs args = targeting({"worker"});
+    FamilyHost host;
+    MWMemweightArgs args = parsed({"worker", "20"});
     const auto first = resolve(args);
+    EXPECT_EQ(args.targetPids(), (MWPidMap{{11, "worker"}, {12, "worker"}, {20, std::nullopt}}));
     host.processes[14] = {.parent = 10, .executable = "/usr/bin/worker"};
     host.processes.erase(11);
     const auto second = resolve(args);
-    EXPECT_EQ(second.pids, (Pids{12, 14}));
+    EXPECT_EQ(second.pids, (Pids{12, 14, 20}));
     EXPECT_EQ(second.standardError, "Unable to analyze process worker [11] (try as root?)\n");
     EXPECT_NE(first.resolution.targets->at(12), second.resolution.targets->at(12));
 }

@@ -3,6 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <fstream>
+#include <iterator>
+#include <list>
+#include <map>
 
 #include "analysis/MWMemweight.h"
 #include "support/FakeHost.h"
@@ -56,124 +60,18 @@ std::string report(const MWTextStyle& style, bool withShell) {
     });
 }
 
-/// A row of these sizes.
-MWMemoryCategory category(uint64_t dirty, uint64_t swapped, uint64_t reclaimable, uint64_t clean) {
-    MWMemoryCategory row;
-    row.setTotalDirtySize(dirty);
-    row.setTotalSwappedSize(swapped);
-    row.setTotalReclaimableSize(reclaimable);
-    row.setTotalCleanSize(clean);
-    return row;
-}
-
 }  // namespace
 
-TEST(MWOutputFormatterText, ReportsTwoProcesses) {
+TEST(MWOutputFormatterText, ReportsAreTheseTexts) {
     const FakeHost host;
+    const auto expected = [](const std::string& name) {
+        std::ifstream file(MEMWEIGHT_REPORTS "/" + name + ".txt");
+        return std::string(std::istreambuf_iterator<char>(file), {});
+    };
+    EXPECT_EQ(report(kBytesWide, false), expected("bytes-wide"));
+    EXPECT_EQ(report(kPages, false), expected("pages-swapped"));
     MWMemweight::setBreakDownPhysMemweight(true);
-    EXPECT_EQ(report(kFormatted, true),
-              R"(======================================================================
-editor [10]: 64-bit	Memweight: 10 MB (4096 bytes per page)
-======================================================================
-
-  Dirty      Clean  Reclaimable    Regions    Category
-    ---        ---          ---        ---    ---
-  10 MB        0 B          0 B          1    Heap
- 8193 B        0 B          0 B          1    Stack
-    ---        ---          ---        ---    ---
-  10 MB        0 B          0 B          3    TOTAL
-
-Shared with sh?[31m [11]:
-  Dirty      Clean  Reclaimable    Regions    Category
-    ---        ---          ---        ---    ---
-    0 B    1024 KB          0 B          2    mapped file
-    ---        ---          ---        ---    ---
-    0 B    1024 KB          0 B          2    TOTAL
-
-======================================================================
-sh?[31m [11]: 32-bit (translated)
-Warnings were encountered while examining the process.
-	slow
-	Memweight: 0 B (4096 bytes per page)
-======================================================================
-
-  Dirty      Clean  Reclaimable    Regions    Category
-    ---        ---          ---        ---    ---
-    0 B        0 B       4095 B          1    Heap
-    ---        ---          ---        ---    ---
-    0 B        0 B       4095 B          1    TOTAL
-
-Shared with editor [10]:
-  Dirty      Clean  Reclaimable    Regions    Category
-    ---        ---          ---        ---    ---
-    0 B    1024 KB          0 B          2    mapped file
-    ---        ---          ---        ---    ---
-    0 B    1024 KB          0 B          2    TOTAL
-
-Auxiliary data:
-	kernel:
-		maps: 10 KB
-	phys: 9999 B
-
-
-Warnings were encountered while examining the following processes:
-	sh?[31m
-======================================================================
-Summary Memweight: 10 MB
-======================================================================
-
-  Dirty      Clean  Reclaimable    Regions    Category
-    ---        ---          ---        ---    ---
-  10 MB        0 B       4095 B          2    Heap
- 8193 B        0 B          0 B          1    Stack
-    0 B    1024 KB          0 B          2    mapped file
-    ---        ---          ---        ---    ---
-  10 MB    1024 KB       4095 B          6    TOTAL
-
-Auxiliary data:
-	kernel:
-		maps: 10 KB
-	phys: 9999 B
-
-)");
-}
-
-TEST(MWOutputFormatterText, ReportsAllColumnsInBytes) {
-    const FakeHost host;
-    EXPECT_EQ(report(kBytesWide, false),
-              R"(==========================================================================================
-editor [10]: 64-bit	Memweight: 10502145 B (4096 bytes per page)
-==========================================================================================
-
-      Dirty     (Swapped)         Clean   Reclaimable       (Wired)    Regions    Category
-        ---           ---           ---           ---           ---        ---    ---
- 10489856 B        4096 B           0 B           0 B           0 B          1    Heap
-     8193 B           0 B           0 B           0 B        8193 B          1    Stack
-        0 B           0 B     1048576 B           0 B           0 B          1    mapped file /usr/lib/libx.so
-        ---           ---           ---           ---           ---        ---    ---
- 10502145 B        4096 B     1048576 B           0 B        8193 B          4    TOTAL
-
-VM Object Dirty Analysis: Enabled
-)");
-}
-
-TEST(MWOutputFormatterText, ReportsPages) {
-    const FakeHost host;
-    EXPECT_EQ(report(kPages, false),
-              R"(================================================================================
-editor [10]: 64-bit	Memweight: 2565 pages (4096 bytes per page)
-================================================================================
-
-      Dirty     (Swapped)         Clean   Reclaimable    Regions    Category
-        ---           ---           ---           ---        ---    ---
-    0 pages       0 pages     256 pages       0 pages          1    mapped file .../libx.so
- 2561 pages       1 pages       0 pages       0 pages          1    Heap
-    3 pages       0 pages       0 pages       0 pages          1    Stack
-        ---           ---           ---           ---        ---    ---
- 2565 pages       1 pages     256 pages       0 pages          4    TOTAL
-
-VM Object Dirty Analysis: Enabled
-)");
+    EXPECT_EQ(report(kFormatted, true), expected("formatted"));
 }
 
 TEST(MWOutputFormatterText, SizesAreRoundedAsTheStyleSays) {
@@ -185,30 +83,34 @@ TEST(MWOutputFormatterText, SizesAreRoundedAsTheStyleSays) {
         }
         return text;
     };
-    EXPECT_EQ(sizes(kFormatted, {0, 9999, 10000, 1048576, 10485760, uint64_t{20} << 40}),
-              "0 B, 9999 B, 10 KB, 1024 KB, 10 MB, 20 TB, ");
-    EXPECT_EQ(sizes(kBytesWide, {0, 10000, UINT64_MAX}), "0 B, 10000 B, -1 B, ");
+    EXPECT_EQ(sizes(kFormatted, {9999, 10000, uint64_t{20} << 40}), "9999 B, 10 KB, 20 TB, ");
+    EXPECT_EQ(sizes(kBytesWide, {UINT64_MAX}), "-1 B, ");
     EXPECT_EQ(sizes(kPages, {1}), "0 pages, ") << "no header was printed, so that the page size is unknown";
 }
 
 TEST(MWOutputFormatterText, NamesAreShortenedToTheirLastComponent) {
     const MWOutputFormatterText brief(kFormatted);
-    const auto truncated = [&](const char* name) { return *brief._truncatedNameForString(name); };
-    EXPECT_EQ(truncated("/usr/lib/libx.so"), ".../libx.so");
-    EXPECT_EQ(truncated("/usr/lib//"), ".../lib");
-    EXPECT_EQ(truncated("main stack"), "main stack");
-    EXPECT_EQ(truncated("/"), "/");
-    EXPECT_EQ(truncated(""), "");
+    const std::map<std::string, std::string> expected = {
+        {"/usr/lib//", ".../lib"}, {"main stack", "main stack"}, {"/", "/"}, {"", ""}};
+    for (const auto& [name, shortened] : expected) {
+        EXPECT_EQ(brief._truncatedNameForString(name), shortened);
+    }
     EXPECT_EQ(brief._truncatedNameForString(std::nullopt), std::nullopt);
-    EXPECT_EQ(MWOutputFormatterText(kBytesWide)._truncatedNameForString("/a/b"), "/a/b");
 }
 
 TEST(MWOutputFormatterText, RowsAreSortedByTheColumnAndThenByKey) {
-    MWCategoryTable table = {{"a", category(14, 0, 9, 9)},
-                             {"b", category(10, 5, 1, 5)},
-                             {"c", category(15, 0, 2, 4)},
-                             {"d", category(12, 3, 1, 7)},
-                             {"E", category(0, 0, 1, 0)}};
+    MWCategoryTable table;
+    const auto addRow = [&table](const std::string& key, const MWCategoryTotals& sizes) {
+        table[key].setTotalDirtySize(sizes.dirty);
+        table[key].setTotalSwappedSize(sizes.swapped);
+        table[key].setTotalReclaimableSize(sizes.reclaimable);
+        table[key].setTotalCleanSize(sizes.clean);
+    };
+    addRow("a", {.dirty = 14, .clean = 9, .reclaimable = 9});
+    addRow("b", {.dirty = 10, .swapped = 5, .clean = 5, .reclaimable = 1});
+    addRow("c", {.dirty = 15, .clean = 4, .reclaimable = 2});
+    addRow("d", {.dirty = 12, .swapped = 3, .clean = 7, .reclaimable = 1});
+    addRow("E", {.reclaimable = 1});
     table["a"].setTotalWiredSize(1);
     table["d"].setTotalRegions(2);
     const auto order = [&](const char* sort) {
@@ -226,55 +128,48 @@ TEST(MWOutputFormatterText, RowsAreSortedByTheColumnAndThenByKey) {
     EXPECT_EQ(order("Wired"), "aEbcd");
     EXPECT_EQ(order("Regions"), "dEabc");
     EXPECT_EQ(order("Category"), "Eabcd") << "by character code";
-    EXPECT_EQ(MWSortColumns(), (std::vector<std::string>{"Dirty", "Swapped", "Clean", "Reclaimable", "Wired",
-                                                         "Regions", "Category"}));
     EXPECT_DEATH(order("dirty"), "Unhandled text sort column");
 }
 
 TEST(MWOutputFormatterText, SharersAreListedUpToTwenty) {
-    const auto sharersOf = [](int32_t members, int32_t reported) {
-        std::vector<std::unique_ptr<FakeProcessSource>> processes;
-        MWProcessGroupMinimal minimal;
+    const auto sharersOf = [](int32_t members) {
+        std::list<FakeProcessSource> processes;
+        MWProcessGroupMinimal group;
         for (int32_t pid = 1; pid <= members; ++pid) {
-            processes.push_back(std::make_unique<FakeProcessSource>(pid, "p"));
-            minimal.addProcess(*processes.back());
+            group.addProcess(processes.emplace_back(pid, "p"));
         }
-        const std::string text = printed(kFormatted, [&](MWOutputFormatterText& formatter) {
-            formatter.printSharedCategories({},
-                                            {.sharedWith = *minimal.immutableCopy(),
-                                             .forProcess = *processes.at(static_cast<size_t>(reported) - 1),
+        const MWSharedCategoriesCall call = {.sharedWith = *group.immutableCopy(),
+                                             .forProcess = *std::next(processes.begin()),
                                              .hasProcessView = true,
-                                             .total = {}});
-        });
-        return text.substr(0, text.find('\n') + 1);
+                                             .total = {}};
+        const std::string text =
+            printed(kFormatted, [&](auto& formatter) { formatter.printSharedCategories({}, call); });
+        return text.substr(0, text.find('\n'));
     };
-    EXPECT_EQ(sharersOf(2, 1), "Shared with p [2]:\n");
-    EXPECT_EQ(sharersOf(3, 3), "Shared with p [1], p [2]:\n");
-    EXPECT_EQ(sharersOf(20, 2).substr(0, 26), "Shared with p [1], p [3], ");
-    EXPECT_EQ(sharersOf(21, 2), "Shared with 21 processes:\n");
+    EXPECT_EQ(sharersOf(2), "Shared with p [1]:");
+    EXPECT_EQ(sharersOf(3), "Shared with p [1], p [3]:");
+    EXPECT_EQ(sharersOf(20).substr(0, 26), "Shared with p [1], p [3], ");
+    EXPECT_EQ(sharersOf(21), "Shared with 21 processes:");
 }
 
 TEST(MWOutputFormatterText, ListsProcessesWithWarningsAndErrors) {
     const FakeProcessSource a(1, "a");
     const FakeProcessSource b(2, "b");
-    using Processes = std::vector<const MWProcess*>;
-    const auto lists = [](const Processes& warned, const Processes& failed,
-                          const std::vector<std::string>& global) {
-        return printed(kFormatted, [&](MWOutputFormatterText& formatter) {
-            formatter.printProcessesWithWarnings(warned,
-                                                 {.processesWithErrors = failed, .globalErrors = global});
-        });
+    const auto lists = [&](const MWProcessErrors& errors) {
+        return printed(kFormatted,
+                       [&](auto& formatter) { formatter.printProcessesWithWarnings({&a}, errors); });
     };
-    EXPECT_EQ(lists({}, {}, {}), "");
-    EXPECT_EQ(lists({&a, &b}, {}, {}),
-              "\nWarnings were encountered while examining the following processes:\n\ta\n\tb\n");
-    EXPECT_EQ(lists({&a}, {&b}, {"stopped\x1b"}),
-              "\nWarnings were encountered while examining the following processes:\n\ta\n"
-              "\nErrors were encountered while examining the following processes:\n\tb\n"
-              "\nErrors were encountered:\n\tstopped?\n"
-              "\nDue to errors, summary results may be invalid\n");
-    EXPECT_EQ(lists({}, {}, {"stopped"}),
-              "\nErrors were encountered:\n\tstopped\n\nDue to errors, summary results may be invalid\n");
+    const std::string warnings =
+        "\nWarnings were encountered while examining the following processes:\n\ta\n";
+    EXPECT_EQ(lists({.processesWithErrors = {}, .globalErrors = {}}), warnings);
+    EXPECT_EQ(lists({.processesWithErrors = {&b, &a}, .globalErrors = {"stopped\x1b"}}),
+              warnings +
+                  "\nErrors were encountered while examining the following processes:\n\tb\n\ta\n"
+                  "\nErrors were encountered:\n\tstopped?\n"
+                  "\nDue to errors, summary results may be invalid\n");
+    EXPECT_EQ(lists({.processesWithErrors = {}, .globalErrors = {"stopped"}}),
+              warnings +
+                  "\nErrors were encountered:\n\tstopped\n\nDue to errors, summary results may be invalid\n");
 }
 
 TEST(MWOutputFormatterText, OneProcessGetsNoSummaryAndEachSampleStartsAnew) {

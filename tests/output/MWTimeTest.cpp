@@ -25,7 +25,6 @@ TEST(MWTime, ReadsThreeClocksAtOnce) {
     EXPECT_FALSE(MWTime::now());
 
     EXPECT_EQ(MWTime::nanosecondsForTicks(24000000, {.numer = 125, .denom = 3}), 1000000000U);
-    EXPECT_EQ(MWTime::nanosecondsForTicks(7, {.numer = 1, .denom = 1}), 7U);
     EXPECT_EQ(MWTime::nanosecondsForTicks(7, {.numer = 1, .denom = 0}), 0U);
     EXPECT_EQ(MWTime::nanosecondsForTicks(UINT64_MAX, {.numer = 2, .denom = 1}), UINT64_MAX - 1) << "wraps";
 }
@@ -38,7 +37,6 @@ TEST(MWDateFormatter, WritesLocalTimeWithItsOffset) {
             MWTime({.wallSeconds = seconds, .wallNanoseconds = nanoseconds}).date());
     };
     constexpr int64_t instant = 1709676429;  // 2024-03-05 22:07:09 UTC
-    EXPECT_EQ(text("PST8PDT,M3.2.0,M11.1.0", instant, 123000000), "2024-03-05 14:07:09.123-08:00");
     EXPECT_EQ(text("UTC0", instant, 4000000), "2024-03-05 22:07:09.004Z");
     EXPECT_EQ(text("NST-5:30", instant, 0), "2024-03-06 03:37:09.000+05:30");
     EXPECT_EQ(text("NST3:30", instant, 0), "2024-03-05 18:37:09.000-03:30");

@@ -3,13 +3,13 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <regex>
 #include <sstream>
 
 #include "platform/RecordedFile.h"
 #include "platform/linux/AddressSpace.h"
 #include "platform/linux/MWLinuxHost.h"
+#include "support/WrittenPages.h"
 
 namespace {
 
@@ -96,18 +96,6 @@ TEST(LinuxImages, FilesAreToldApartByInode) {
               "  a000+1000 __DATA\n  c000+1000 __DATA\n");
 }
 
-/// Every page is anonymous and mapped by several processes.
-class ForkedPages : public PageSource {
-public:
-    bool knowsHoles() override { return false; }
-    bool readPages(uint64_t, std::span<PagemapEntry> entries) override {
-        std::fill(entries.begin(), entries.end(), PagemapEntry{uint64_t{1} << 63U});
-        return true;
-    }
-    void clearZeroPages(uint64_t, std::span<PagemapEntry>) override {}
-    uint64_t nextPopulated(uint64_t address, uint64_t) override { return address; }
-};
-
 // All within one window of addresses. Each library's data is shown under a name of its own, so it may not be
 // joined with another's.
 TEST(LinuxImages, MemorySharedByForkIsAnObjectForEachImage) {
@@ -117,7 +105,10 @@ TEST(LinuxImages, MemorySharedByForkIsAnObjectForEachImage) {
     ShmemDevices devices;
     RegionNames names;
     ForkFamily family(77);
-    ForkedPages pages;
+    WrittenPages pages;
+    for (uint64_t address = 0x400000; address < 0x409000; address += kPage) {
+        pages.pages[address] = {uint64_t{1} << 63U};
+    }
     const AddressSpace space(procfs::parseSmaps("400000-401000 r-xp 00000000 fe:00 1 /lib/x\nRss: 0 kB\n"
                                                 "401000-402000 rw-p 00001000 fe:00 1 /lib/x\n" +
                                                 counts + "402000-403000 rw-p 00000000 00:00 0\n" + counts +

@@ -52,10 +52,11 @@ PageFrameFlags recordedFlags(const std::vector<uint64_t>& flags) {
     return PageFrameFlags(procfs::Descriptor(descriptor));
 }
 
+const PageFrameFlags none{procfs::Descriptor()};
+
 using Words = std::vector<int32_t>;
 
 TEST(PageDispositions, KindsOfPages) {
-    const PageFrameFlags none{procfs::Descriptor()};
     const std::vector<PagemapEntry> entries = {absent, swapped, anonymous(), file()};
     PageDispositions pages;
     EXPECT_EQ(words(pages, regionOf(Backing::file), 0x10000, entries, none),
@@ -67,7 +68,6 @@ TEST(PageDispositions, KindsOfPages) {
 }
 
 TEST(PageDispositions, WithoutFrameFlagsTheRegionsCountsDecideInOrder) {
-    const PageFrameFlags none{procfs::Descriptor()};
     PageDispositions pages;
     const AddressSpaceRegion region = regionOf(Backing::file, 3 * kPage);
     EXPECT_EQ(words(pages, region, 0x10000, {file(), absent, file()}, none),
@@ -81,7 +81,6 @@ TEST(PageDispositions, WithoutFrameFlagsTheRegionsCountsDecideInOrder) {
 }
 
 TEST(PageDispositions, SwappedShmemLooksAbsent) {
-    const PageFrameFlags none{procfs::Descriptor()};
     PageDispositions pages;
     AddressSpaceRegion region = regionOf(Backing::shmem);
     region.info.pages_swapped_out = 1;

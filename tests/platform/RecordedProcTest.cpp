@@ -20,13 +20,19 @@ protected:
     void SetUp() override { ASSERT_NE(mkdtemp(_top.data()), nullptr); }
     void TearDown() override { std::filesystem::remove_all(_top); }
 
-    void write(const std::string& path, const std::string& text) {
-        std::filesystem::create_directories(std::filesystem::path(_top + "/" + path).parent_path());
-        std::ofstream(_top + "/" + path) << text;
+    std::filesystem::path place(const std::string& path) {
+        const std::filesystem::path result = _top + "/" + path;
+        std::filesystem::create_directories(result.parent_path());
+        return result;
     }
-    void link(const std::string& path, const std::string& target) {
-        std::filesystem::create_directories(std::filesystem::path(_top + "/" + path).parent_path());
-        std::filesystem::create_symlink(target, _top + "/" + path);
+    void write(const std::string& path, const std::string& text) { std::ofstream(place(path)) << text; }
+    void link(const std::string& path, const char* target) {
+        std::filesystem::create_symlink(target, place(path));
+    }
+    void writeProcess(const std::string& pid, const std::string& stat, const std::string& smaps) {
+        write(pid + "/stat", stat);
+        write(pid + "/maps", "");
+        write(pid + "/smaps", smaps);
     }
     procfs::Descriptor directory(const std::string& path) {
         return procfs::open(AT_FDCWD, (_top + "/" + path).c_str(), O_DIRECTORY);
@@ -39,9 +45,6 @@ std::string statOf(int pid, char state, uint64_t flags, int threads) {
     return std::to_string(pid) + " (x) " + state + " 1 1 1 0 -1 " + std::to_string(flags) +
            " 0 0 0 0 0 0 0 0 20 0 " + std::to_string(threads) + " 0 500 0 0 0 1 2 3 0 0\n";
 }
-
-const std::string kMapping =
-    "1000-3000 rw-p 00000000 00:00 0\nRss: 8 kB\nAnonymous: 8 kB\nPrivate_Dirty: 8 kB\n";
 
 kern_return_t walkOf(MWLinuxHost& host, int32_t pid) {
     task_t task = 0;
@@ -58,13 +61,9 @@ kern_return_t walkOf(MWLinuxHost& host, int32_t pid) {
 
 TEST_F(RecordedProc, AProcessBeingTornDownIsGoneThoughItStillRuns) {
     constexpr uint64_t kExiting = 4;
-    write("20/stat", statOf(20, 'R', kExiting, 1));
-    write("20/maps", "");
-    write("20/smaps", "");
+    writeProcess("20", statOf(20, 'R', kExiting, 1), "");
     write("20/task/20/stat", statOf(20, 'R', kExiting, 1));
-    write("21/stat", statOf(21, 'S', 0, 1));
-    write("21/maps", "");
-    write("21/smaps", "");
+    writeProcess("21", statOf(21, 'S', 0, 1), "");
     write("21/task/21/stat", statOf(21, 'S', 0, 1));
     MWLinuxHost host(_top);
     EXPECT_EQ(walkOf(host, 20), MACH_SEND_INVALID_DEST);
@@ -75,13 +74,10 @@ TEST_F(RecordedProc, AProcessBeingTornDownIsGoneThoughItStillRuns) {
 }
 
 TEST_F(RecordedProc, AProcessIsReadThroughAThreadThatLives) {
-    write("20/stat", statOf(20, 'Z', 4, 2));
-    write("20/maps", "");
-    write("20/smaps", "");
+    writeProcess("20", statOf(20, 'Z', 4, 2), "");
     write("20/task/20/stat", statOf(20, 'Z', 4, 2));
-    write("20/task/22/stat", statOf(22, 'S', 0, 2));
-    write("20/task/22/maps", "");
-    write("20/task/22/smaps", kMapping);
+    writeProcess("20/task/22", statOf(22, 'S', 0, 2),
+                 "1000-3000 rw-p 00000000 00:00 0\nRss: 8 kB\nAnonymous: 8 kB\nPrivate_Dirty: 8 kB\n");
     MWLinuxHost host(_top);
     EXPECT_EQ(walkOf(host, 20), KERN_SUCCESS);
 }

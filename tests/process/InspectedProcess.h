@@ -6,9 +6,18 @@
 #include <optional>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "platform/MWHostInterface.h"
 #include "process/MWUserProcess.h"
+#include "support/FakeHost.h"
+
+using Lines = std::vector<std::string>;
+
+constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
+constexpr int32_t kDirty = kPresent | VM_PAGE_QUERY_PAGE_DIRTY;
+constexpr int32_t kSwapped = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+constexpr int32_t kClean = kPresent | VM_PAGE_QUERY_PAGE_EXTERNAL;
 
 /// A process of the fake host whose steps a test calls one by one, and for which it writes down what the
 /// kernel tells beside the regions.
@@ -29,7 +38,6 @@ public:
     }
     void setPageTables(uint64_t bytes) { _ledgers[0] = bytes; }
 
-    using MWUserProcess::_addErrnoWarningWithDescription;
     using MWUserProcess::_addSubrangesForRegion;
     using MWUserProcess::_populateMemoryRegionWithPageQueries;
     using MWUserProcess::_setSharedRegionFromPlatform;

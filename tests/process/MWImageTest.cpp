@@ -6,25 +6,11 @@
 
 namespace {
 
-MWImage image(uint64_t start, uint64_t end, const std::string& name = "__DATA") {
+MWImage image(uint64_t start, uint64_t end) {
     MWImage result;
     result.setStart(start);
     result.setSize(end - start);
-    result.setName(std::make_shared<const std::string>(name));
     return result;
-}
-
-TEST(MWImageTest, KindFollowsSegmentName) {
-    const std::vector<std::pair<std::string, uint8_t>> kinds = {
-        {"__TEXT", SegmentText},         {"__TEXT_EXEC", SegmentText}, {"__OBJC_RO", SegmentText},
-        {"__OBJC_RW", SegmentData},      {"__DATA", SegmentData},      {"__DATA_CONST", SegmentData},
-        {"__LINKEDIT", SegmentLinkedit}, {"_TEXT", SegmentNone},       {"unknown", SegmentNone}};
-    for (const auto& [name, kind] : kinds) {
-        EXPECT_EQ(image(0, 1, name).segment(), kind) << name;
-    }
-    MWImage renamed = image(0, 1, "__LINKEDIT");
-    renamed.setName(std::make_shared<const std::string>("unknown"));
-    EXPECT_EQ(renamed.segment(), SegmentLinkedit);
 }
 
 TEST(MWImageTest, EnumeratorFindsOverlapAndLeavesBehindWhatIsBelow) {

@@ -57,13 +57,4 @@ TEST(MWInterningTableTest, ThreadsAgreeOnOneCopyOfEachText) {
     EXPECT_EQ(copies.size(), kTexts);
 }
 
-TEST(MWInterningTableTest, ImageAddressChoosesSlotOfItsPath) {
-    // 0x1A3456000 ^ 0x1A3456 ^ 0x1A34 ^ 0x1A, and 0x300 ^ 0x3, are 771 modulo the number of slots; 0x904 ^
-    // 0x9 is 270.
-    const auto path = MWInternPath("/usr/lib/libsample.so", 0x1A3456000);
-    EXPECT_EQ(MWInternPath("/usr/lib/libsample.so", 0x300), path);
-    EXPECT_NE(MWInternPath("/usr/lib/libsample.so", 0x904), path);
-    EXPECT_NE(*MWInternPath("/usr/lib/libother.so", 0x300), *path);
-}
-
 }  // namespace

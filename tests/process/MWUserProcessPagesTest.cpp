@@ -4,17 +4,13 @@
 #include <vector>
 
 #include "process/InspectedProcess.h"
-#include "support/FakeHost.h"
 
 namespace {
 
-constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
-constexpr int32_t kDirty = kPresent | VM_PAGE_QUERY_PAGE_DIRTY;
-constexpr int32_t kSwapped = VM_PAGE_QUERY_PAGE_PAGED_OUT;
-constexpr int32_t kClean = kPresent | VM_PAGE_QUERY_PAGE_EXTERNAL;
 constexpr int32_t kReusable = kPresent | VM_PAGE_QUERY_PAGE_REUSABLE;
 
 using Queries = std::vector<std::pair<uint64_t, uint64_t>>;  // start, pages
+using Sizes = std::vector<std::pair<uint64_t, uint64_t>>;    // dirty, swapped
 
 std::shared_ptr<MWMemoryRegion> region(uint64_t start, uint64_t end, bool gap = false) {
     auto result = std::make_shared<MWMemoryRegion>();
@@ -25,13 +21,11 @@ std::shared_ptr<MWMemoryRegion> region(uint64_t start, uint64_t end, bool gap = 
 }
 
 /// Dirty and swapped bytes of neighbouring shared-cache regions after each was measured in turn.
-std::vector<std::pair<uint64_t, uint64_t>> measure(
-    InspectedProcess& process, const std::vector<std::shared_ptr<MWMemoryRegion>>& regions) {
+Sizes measure(InspectedProcess& process, const std::vector<std::shared_ptr<MWMemoryRegion>>& regions) {
     for (const auto& one : regions) {
         EXPECT_TRUE(process._populateMemoryRegionWithPageQueries(one, {}));
     }
-    std::vector<std::pair<uint64_t, uint64_t>> sizes;
-    sizes.reserve(regions.size());
+    Sizes sizes;
     for (const auto& one : regions) {
         sizes.emplace_back(one->dirtySize(), one->swappedSize());
     }
@@ -50,21 +44,17 @@ struct World {
     }
 };
 
-using Sizes = std::vector<std::pair<uint64_t, uint64_t>>;  // dirty, swapped
-
 TEST(MWUserProcessPagesTest, SplitsBytesOfPageBetweenNeighbours) {
     const World world({kPresent, kDirty, kSwapped});
     EXPECT_EQ(measure(*InspectedProcess::of(7), {region(0x41000, 0x45000), region(0x45000, 0x49000)}),
               (Sizes{{0x3000 + 0x1000, 0}, {0x3000, 0x1000}}));
     EXPECT_EQ(world.host.pageQueries, (Queries{{0x40000, 2}, {0x48000, 1}})) << "the page between once";
-}
 
-TEST(MWUserProcessPagesTest, RegionsWithinOnePageShareItsOneQuery) {
-    const World world({kDirty, kClean});
+    const World within({kDirty, kClean});
     EXPECT_EQ(measure(*InspectedProcess::of(7),
                       {region(0x41000, 0x42000), region(0x42000, 0x42800), region(0x42800, 0x48000)}),
               (Sizes{{0x1000, 0}, {0x800, 0}, {0x1800, 0}}));
-    EXPECT_EQ(world.host.pageQueries, (Queries{{0x40000, 1}, {0x44000, 1}}));
+    EXPECT_EQ(within.host.pageQueries, (Queries{{0x40000, 1}, {0x44000, 1}}));
 }
 
 TEST(MWUserProcessPagesTest, GapIsCreditedWhenItsLastPageIsQueriedForTheNextRegion) {
@@ -76,14 +66,9 @@ TEST(MWUserProcessPagesTest, GapIsCreditedWhenItsLastPageIsQueriedForTheNextRegi
                       {region(0x40000, 0x41000), region(0x41000, 0x49000, true), region(0x49000, 0x4C000)}),
               (Sizes{{0x1000, 0}, {0x3000, 0x1000}, {0, 0x3000}}));
     EXPECT_EQ(world.host.pageQueries, (Queries{{0x40000, 1}, {0x48000, 1}}));
-    EXPECT_EQ(measure(*process, {region(0x44000, 0x49000, true), region(0x4A000, 0x4C000)}),
-              (Sizes{{0, 0}, {0, 0x2000}}))
-        << "what does not border on the gap tells nothing about it";
     EXPECT_EQ(measure(*process, {region(0x46000, 0x49000, true), region(0x49000, 0x4C000)}),
               (Sizes{{0, 0}, {0, 0x3000}}))
         << "a gap that begins within an unknown page is credited nothing";
-    EXPECT_EQ(measure(*process, {region(0x44000, 0x49000, true), region(0x49000, 0x4C000)}),
-              (Sizes{{0, 0x1000}, {0, 0x3000}}));
 }
 
 TEST(MWUserProcessPagesTest, AsksForAtMost4096PagesAtOnce) {
@@ -91,20 +76,16 @@ TEST(MWUserProcessPagesTest, AsksForAtMost4096PagesAtOnce) {
     const auto process = InspectedProcess::of(7);
     EXPECT_EQ(measure(*process, {region(0x40000, 0x40000 + 5000 * 4096)}), (Sizes{{5000 * 4096, 0}}));
     EXPECT_EQ(world.host.pageQueries, (Queries{{0x40000, 4096}, {0x40000 + 4096 * 4096, 904}}));
-    EXPECT_EQ(measure(*process, {region(0x40000, 0x40000)}), (Sizes{{0, 0}}));
-    EXPECT_EQ(world.host.pageQueries.size(), 2) << "nothing to ask about an empty region";
 }
 
 TEST(MWUserProcessPagesTest, FailedQueryIsFiledAndFailsTheMeasurement) {
     World world({kDirty});
     const auto process = InspectedProcess::of(7);
     world.host.processes[7].pageQueryFailure = KERN_INVALID_ARGUMENT;
-    EXPECT_FALSE(process->_populateMemoryRegionWithPageQueries(region(0x40000, 0x44000), {}));
-    EXPECT_EQ(process->errors(), std::vector<std::string>{"victim [7]: code 4"});
     world.host.processes[7].gone = true;
     EXPECT_FALSE(process->_populateMemoryRegionWithPageQueries(region(0x40000, 0x44000), {}));
-    EXPECT_EQ(process->warnings(), std::vector<std::string>{"victim [7]: code 4 (process exited)"});
-    EXPECT_EQ(world.host.machErrors.front(), "mach_vm_page_range_query: 4");
+    EXPECT_EQ(process->warnings(), Lines{"victim [7]: code 4 (process exited)"});
+    EXPECT_EQ(world.host.machErrors, Lines{"mach_vm_page_range_query: 4"});
 }
 
 using PageRun = std::tuple<uint64_t, uint64_t, MWCategoryTotals>;
@@ -145,21 +126,20 @@ TEST(MWUserProcessPagesTest, SubrangesAreRunsOfOneKindWithinTheObject) {
          {{0, 12288, {.dirty = 4096, .swapped = 4096, .clean = 4096}}}},
         {{0, 0}, VM_PURGABLE_DENY, {}},
     };
+    constexpr uint64_t kOffset = 0x100000;
     for (const Case& c : cases) {
-        for (const uint64_t offset : {uint64_t{0}, uint64_t{0x100000}}) {
-            for (const bool wired : {false, true}) {
-                const World world(c.pages, 4096);
-                const auto one = region(0x40000, 0x40000 + c.pages.size() * 4096);
-                one->setOffset(offset);
-                one->setWired(wired);
-                InspectedProcess::of(7)->_addSubrangesForRegion(*one, c.purgeState);
-                std::vector<PageRun> expected = c.runs;
-                for (auto& [start, length, totals] : expected) {
-                    start += offset;
-                    totals.wired = wired ? length : 0;
-                }
-                EXPECT_EQ(runsOf(*one), expected);
+        for (const bool wired : {false, true}) {
+            const World world(c.pages, 4096);
+            const auto one = region(0x40000, 0x40000 + c.pages.size() * 4096);
+            one->setOffset(kOffset);
+            one->setWired(wired);
+            InspectedProcess::of(7)->_addSubrangesForRegion(*one, c.purgeState);
+            std::vector<PageRun> expected = c.runs;
+            for (auto& [start, length, totals] : expected) {
+                start += kOffset;
+                totals.wired = wired ? length : 0;
             }
+            EXPECT_EQ(runsOf(*one), expected);
         }
     }
 }

@@ -1,15 +1,11 @@
 #include <fmt/core.h>
 #include <gtest/gtest.h>
 
-#include <cerrno>
 #include <vector>
 
 #include "process/InspectedProcess.h"
-#include "support/FakeHost.h"
 
 namespace {
-
-using Lines = std::vector<std::string>;
 
 /// "START+SIZE object ID purge STATE PATH" of every region that the walk of process 7 delivers.
 struct Walk {
@@ -69,15 +65,15 @@ TEST(MWUserProcessWalkTest, FilesFailureByWhatBecameOfProcess) {
     struct Case {
         kern_return_t failure;
         Fate fate;
-        std::string error;
-        std::string warning;
+        Lines errors;
+        Lines warnings;
     };
     const std::vector<Case> cases = {
-        {KERN_INVALID_ADDRESS, alive, "", ""},
-        {KERN_FAILURE, exited, "victim [7]: code 5", ""},
-        {MACH_SEND_INVALID_DEST, alive, "victim [7]: code 268435459", ""},
-        {MACH_SEND_INVALID_DEST, zombie, "", "victim [7]: code 268435459 (zombie)"},
-        {MACH_SEND_INVALID_DEST, exited, "", "victim [7]: code 268435459 (process exited)"},
+        {KERN_INVALID_ADDRESS, alive, {}, {}},
+        {KERN_FAILURE, exited, {"victim [7]: code 5"}, {}},
+        {MACH_SEND_INVALID_DEST, alive, {"victim [7]: code 268435459"}, {}},
+        {MACH_SEND_INVALID_DEST, zombie, {}, {"victim [7]: code 268435459 (zombie)"}},
+        {MACH_SEND_INVALID_DEST, exited, {}, {"victim [7]: code 268435459 (process exited)"}},
     };
     for (const Case& c : cases) {
         FakeHost host;
@@ -92,8 +88,8 @@ TEST(MWUserProcessWalkTest, FilesFailureByWhatBecameOfProcess) {
         const bool ordinaryEnd = c.failure == KERN_INVALID_ADDRESS;
         EXPECT_EQ(testing::internal::GetCapturedStderr(), ordinaryEnd ? "" : kBailingOut);
         EXPECT_EQ(host.machErrors.size(), ordinaryEnd ? 0 : 1);
-        EXPECT_EQ(process->errors(), c.error.empty() ? Lines() : Lines{c.error});
-        EXPECT_EQ(process->warnings(), c.warning.empty() ? Lines() : Lines{c.warning});
+        EXPECT_EQ(process->errors(), c.errors);
+        EXPECT_EQ(process->warnings(), c.warnings);
         ASSERT_TRUE(process->memoryRegions());
         EXPECT_EQ(process->memoryRegions()->size(), 1) << "what was gathered before is kept";
     }
@@ -135,10 +131,9 @@ TEST(MWUserProcessWalkTest, ReportsSharedCacheMappingsWhole) {
     EXPECT_EQ(host.asked("mach_vm_region_recurse"), 4);
     InspectedProcess::of(7)->enumerateRegions([](const MWWalkedRegion& region) {
         if (region.address == 0x180000000) {
-            EXPECT_EQ(region.info.share_mode, SM_COW);
-            EXPECT_EQ(region.info.external_pager, 1);
-            EXPECT_EQ(region.info.user_wired_count, 2);
-            EXPECT_EQ(region.info.offset, 0x100);
+            const auto& info = region.info;
+            EXPECT_TRUE(info.share_mode == SM_COW && info.external_pager == 1);
+            EXPECT_TRUE(info.user_wired_count == 2 && info.offset == 0x100);
         }
         return false;
     });
@@ -160,21 +155,17 @@ TEST(MWUserProcessWalkTest, SharedCacheCountsOnlyWhereThereIsOne) {
     host.processes[7] = victim({{.start = 0x1000, .size = 0x1000}, {.start = 0x180000000, .size = 0x1000}});
     const auto plain = InspectedProcess::of(7);
     plain->gatherData();
-    EXPECT_EQ(plain->memoryRegions()->size(), 2);
     EXPECT_FALSE(plain->memoryRegions()->back()->inSharedCache());
     EXPECT_EQ(host.asked("mach_vm_region"), 0);
 
     host.sharedCache = true;
-    const auto hidden = InspectedProcess::of(7);
-    hidden->setHiddenFromDisplay(true);
-    hidden->gatherData();
-    EXPECT_EQ(hidden->memoryRegions()->size(), 1);
-    EXPECT_EQ(hidden->errors(), Lines());
-    const auto shown = InspectedProcess::of(7);
-    shown->gatherData();
-    EXPECT_EQ(shown->memoryRegions()->size(), 2);
-    EXPECT_TRUE(shown->memoryRegions()->back()->inSharedCache());
-
+    for (const bool isHidden : {false, true}) {
+        const auto process = InspectedProcess::of(7);
+        process->setHiddenFromDisplay(isHidden);
+        process->gatherData();
+        EXPECT_EQ(process->memoryRegions()->size(), isHidden ? 1 : 2);
+        EXPECT_EQ(process->memoryRegions()->back()->inSharedCache(), !isHidden);
+    }
     testing::internal::CaptureStderr();
     EXPECT_FALSE(plain->_setSharedRegionFromPlatform(MWPlatformUnknown));
     EXPECT_EQ(testing::internal::GetCapturedStderr(),

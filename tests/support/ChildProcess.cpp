@@ -10,7 +10,8 @@
 
 namespace {
 
-[[noreturn]] void runChild(int answerPipe, const std::function<uint64_t()>& setUp) {
+// An exception ends the child, which is not to go on with its parent's test.
+[[noreturn]] void runChild(int answerPipe, const std::function<uint64_t()>& setUp) noexcept {
     prctl(PR_SET_PDEATHSIG, SIGKILL);
     const uint64_t answer = setUp();
     if (write(answerPipe, &answer, sizeof(answer)) != sizeof(answer)) {

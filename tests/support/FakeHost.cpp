@@ -234,7 +234,7 @@ int FakeHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& leng
         return _fail(EINVAL);
     }
     // The argument count, then the path.
-    const std::string bytes = std::string(4, '\1') + process->executable + std::string(3, '\0');
+    const std::string bytes = std::string("\1\0\0\0", 4) + process->executable + std::string(3, '\0');
     length = std::min(bytes.size(), area.size());
     std::copy_n(bytes.begin(), length, area.begin());
     return 0;
@@ -271,12 +271,4 @@ void FakeHost::forEachImage(task_t task, const std::function<void(const MWImageD
     for (const auto& image : processes.at(pidOfTask(task)).images) {
         block(FakeImageCursor(image));
     }
-}
-
-int FakeHost::mach_get_times(MWClockReading& reading) {
-    if (clockFails) {
-        return -1;
-    }
-    reading = clock;
-    return 0;
 }

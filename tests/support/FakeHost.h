@@ -109,7 +109,10 @@ public:
     void mach_error(std::string_view label, kern_return_t code) override;
     std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
     void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
-    int mach_get_times(MWClockReading& reading) override;
+    int mach_get_times(MWClockReading& reading) override {
+        reading = clockFails ? reading : clock;
+        return clockFails ? -1 : 0;
+    }
     mach_timebase_info_t mach_timebase_info() override { return {1, 1}; }
     int32_t getpid() override { return ownPid; }
     uint32_t geteuid() override { return effectiveUser; }
@@ -119,7 +122,7 @@ public:
 
 private:
     void _count(const std::string& operation);
-    /// errno's value, and the failure that goes with it.
+    /// Sets errno and returns what a failing BSD-style operation does.
     static int _fail(int error);
     /// None, and errno ESRCH, when there is no such process (any more).
     const FakeProcess* _find(int32_t pid);

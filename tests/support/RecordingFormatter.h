@@ -10,18 +10,15 @@
 
 /// The parts of the totals that are not 0, by initial: "d4096 n1".
 inline std::string describe(const MWCategoryTotals& total) {
+    const std::pair<char, uint64_t> parts[] = {{'d', total.dirty}, {'s', total.swapped},
+                                               {'c', total.clean}, {'r', total.reclaimable},
+                                               {'w', total.wired}, {'n', total.regions}};
     std::string text;
-    const auto add = [&text](const char* initial, uint64_t number) {
+    for (const auto& [initial, number] : parts) {
         if (number != 0) {
-            text += (text.empty() ? "" : " ") + std::string(initial) + std::to_string(number);
+            text += (text.empty() ? "" : " ") + (initial + std::to_string(number));
         }
-    };
-    add("d", total.dirty);
-    add("s", total.swapped);
-    add("c", total.clean);
-    add("r", total.reclaimable);
-    add("w", total.wired);
-    add("n", total.regions);
+    }
     return text.empty() ? "0" : text;
 }
 
@@ -29,21 +26,19 @@ inline std::string describe(const MWCategoryTotals& total) {
 inline std::string describe(const MWCategoryTable& categories) {
     std::string text;
     for (const auto& [key, category] : categories) {
-        const MWCategoryTotals sums = {.dirty = category.totalDirtySize(),
-                                       .swapped = category.totalSwappedSize(),
-                                       .clean = category.totalCleanSize(),
-                                       .reclaimable = category.totalReclaimableSize(),
-                                       .wired = category.totalWiredSize(),
-                                       .regions = static_cast<uint32_t>(category.totalRegions())};
+        const MWCategoryTotals sums = {
+            category.totalDirtySize(), category.totalSwappedSize(),
+            category.totalCleanSize(), category.totalReclaimableSize(),
+            category.totalWiredSize(), static_cast<uint32_t>(category.totalRegions())};
         text += (text.empty() ? "" : "; ") + key + " " + describe(sums);
     }
     return text;
 }
 
-/// Writes each call down as one line, "NAME: CALL", in a log that several formatters can share.
+/// Writes each call down as one line.
 class RecordingFormatter : public MWOutputFormatter {
 public:
-    RecordingFormatter(std::string name, std::vector<std::string>& log) : _name(std::move(name)), _log(log) {}
+    explicit RecordingFormatter(std::vector<std::string>& log) : _log(log) {}
 
     void printProcessHeader(const MWProcess& process) override { _line("header " + process.displayString()); }
     void endProcessHeader(const MWProcess& process) override {
@@ -85,7 +80,7 @@ public:
     }
 
 private:
-    void _line(const std::string& call) { _log.push_back(_name + ": " + call); }
+    void _line(const std::string& call) { _log.push_back(call); }
     static std::string _names(const std::vector<const MWProcess*>& processes) {
         std::string text;
         for (const MWProcess* process : processes) {
@@ -94,15 +89,15 @@ private:
         return text;
     }
     static std::string _text(const MWAuxDataTree& auxData) {
-        std::string text;
-        if (auxData) {
-            for (const auto& [name, datum] : auxData->elements()) {
-                text += " " + name + "=" + std::to_string(static_cast<const MWAuxData&>(*datum).value());
-            }
+        if (!auxData) {
+            return " none";
         }
-        return auxData ? text : " none";
+        std::string text;
+        for (const auto& [name, datum] : auxData->elements()) {
+            text += " " + name + "=" + std::to_string(static_cast<const MWAuxData&>(*datum).value());
+        }
+        return text;
     }
 
-    std::string _name;
     std::vector<std::string>& _log;
 };

@@ -16,8 +16,7 @@ public:
 
     bool readPages(uint64_t address, std::span<PagemapEntry> entries) override {
         for (PagemapEntry& entry : entries) {
-            const auto found = pages.find(address);
-            entry = found == pages.end() ? PagemapEntry{} : found->second;
+            entry = pages.contains(address) ? pages.at(address) : PagemapEntry{};
             address += 4096;
         }
         return true;

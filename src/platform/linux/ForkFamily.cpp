@@ -35,6 +35,7 @@ std::optional<RandomBytes> readRandomBytes(int32_t pid, std::string_view auxv) {
     }
     RandomBytes bytes = {};
     const iovec local = {bytes.data(), bytes.size()};
+    // NOLINTNEXTLINE(performance-no-int-to-ptr): an address of the other process, not of this one
     const iovec remote = {reinterpret_cast<void*>(*address), bytes.size()};
     const bool read = process_vm_readv(pid, &local, 1, &remote, 1, 0) == static_cast<ssize_t>(bytes.size());
     return read ? std::optional(bytes) : std::nullopt;

@@ -14,7 +14,6 @@ struct Ownership {
     uint32_t generation = 0;
 
     bool operator==(const Ownership&) const = default;
-    auto operator<=>(const Ownership&) const = default;
 };
 
 Ownership ownershipOf(const OwnershipRun& run) {
@@ -141,7 +140,7 @@ private:
     void _groupByOwner(uint64_t start) {
         const uint64_t end = _window.back().end;
         std::stable_sort(_window.begin(), _window.end(), [](const OwnershipRun& a, const OwnershipRun& b) {
-            return ownershipOf(a) < ownershipOf(b);
+            return std::pair(a.owner, a.generation) < std::pair(b.owner, b.generation);
         });
         std::vector<OwnershipRun> grouped;
         for (const OwnershipRun& run : _window) {

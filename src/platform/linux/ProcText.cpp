@@ -44,7 +44,7 @@ std::optional<ProcStat> parseStat(std::string_view text) {
     if (close == std::string_view::npos || !takeNumber(front, stat.pid) || !takePrefix(front, " (")) {
         return std::nullopt;
     }
-    const size_t nameStart = static_cast<size_t>(front.data() - text.data());
+    const auto nameStart = static_cast<size_t>(front.data() - text.data());
     if (close < nameStart || close + 2 >= text.size()) {
         return std::nullopt;
     }

@@ -42,7 +42,7 @@ constexpr std::array<std::pair<std::string_view, VmFlag>, 12> kFlags = {{{"mr", 
                                                                          {"ss", VmFlagShadowStack}}};
 
 // A line of a mapping holds one path, of at most 4096 bytes of which each can be written as four.
-constexpr size_t kLongestLine = 5 * 4096;
+constexpr size_t kLongestLine = size_t{5} * 4096;
 
 uint32_t parseFlags(std::string_view text) {
     uint32_t flags = 0;

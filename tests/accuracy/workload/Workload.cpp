@@ -1,7 +1,7 @@
-// Processes with a known history of their memory, for measuring: SCENARIO NUMBER... Sizes are MiB. Each
-// process is reported on standard output as "NAME PID" when its memory is as the scenario wants it, then
-// waits to be killed; "ready" comes last. A program of its own, so that nothing but the scenario (no test
-// framework, no sanitizer) is in its memory.
+// Processes with a known history of their memory, for measuring: "SCENARIO NUMBER...", one argument. Sizes
+// are MiB. Each process is reported on standard output as "NAME PID" when its memory is as the scenario wants
+// it, then waits to be killed; "ready" comes last. A program of its own, so that nothing but the scenario (no
+// test framework, no sanitizer) is in its memory.
 
 #include <fcntl.h>
 #include <sched.h>
@@ -17,10 +17,12 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
+#include <fstream>
 #include <functional>
+#include <iterator>
 #include <map>
 #include <random>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -121,16 +123,16 @@ void readPages(const char* start, size_t size) {
     }
 }
 
-/// The scenario's arguments.
+/// The words behind the scenario's name.
 class Arguments {
 public:
-    explicit Arguments(std::vector<const char*> texts) : _texts(std::move(texts)) {}
-    size_t count(size_t index) const { return std::stoul(_texts.at(index)); }
+    explicit Arguments(std::istream& words) : _words(std::istream_iterator<std::string>(words), {}) {}
+    size_t count(size_t index) const { return std::stoul(_words.at(index)); }
     size_t size(size_t index) const { return count(index) * kMiB; }
-    const char* text(size_t index) const { return _texts.at(index); }
+    const char* text(size_t index) const { return _words.at(index).c_str(); }
 
 private:
-    std::vector<const char*> _texts;
+    std::vector<std::string> _words;
 };
 
 std::string numbered(const char* name, size_t number) {
@@ -161,10 +163,11 @@ void forkTree(const Arguments& arguments) {
     }
 }
 
-/// A descriptor of a new memory or disk file of this size.
-int fileOfSize(int file, size_t size) {
-    require(file >= 0 && ftruncate(file, static_cast<off_t>(size)) == 0, "a file to share");
-    return file;
+/// One page of every `step` bytes.
+void touchEvery(size_t step, char* start, size_t size) {
+    for (size_t page = 0; page < size; page += step) {
+        touch(start + page, kPage);
+    }
 }
 
 // PROCESSES SIZE FILE SHMFILE: each kind of memory that is shared by mapping it, SIZE of each kind, of which
@@ -173,10 +176,13 @@ void sharedObjects(const Arguments& arguments) {
     const size_t processes = arguments.count(0);
     const size_t size = arguments.size(1);
     const size_t step = size / (processes + 1) / kPage * kPage;
-    const std::array<int, 3> files = {
-        fileOfSize(memfd_create("shared", MFD_CLOEXEC), size),
-        fileOfSize(open(arguments.text(2), O_RDWR | O_CREAT | O_CLOEXEC, 0600), size),
-        fileOfSize(open(arguments.text(3), O_RDWR | O_CREAT | O_CLOEXEC, 0600), size)};
+    constexpr int kNew = O_RDWR | O_CREAT | O_CLOEXEC;
+    const std::array<int, 3> files = {memfd_create("shared", MFD_CLOEXEC),
+                                      open(arguments.text(2), kNew, 0600),
+                                      open(arguments.text(3), kNew, 0600)};
+    for (const int file : files) {
+        require(ftruncate(file, static_cast<off_t>(size)) == 0, "a file to share");
+    }
     const int segment = shmget(IPC_PRIVATE, size, IPC_CREAT | 0600);
     char* attached = static_cast<char*>(shmat(segment, nullptr, 0));
     // Removed with its last user.
@@ -189,15 +195,10 @@ void sharedObjects(const Arguments& arguments) {
                 const Mapping part = {.flags = MAP_SHARED, .file = file, .offset = offset};
                 touch(map(2 * step, part), 2 * step);
                 // Again at another place, untouched but for one page in three.
-                char* again = map(2 * step, part);
-                for (size_t page = 0; page < 2 * step; page += 3 * kPage) {
-                    touch(again + page, kPage);
-                }
+                touchEvery(3 * kPage, map(2 * step, part), 2 * step);
             }
             touch(attached + offset, 2 * step);
-            for (size_t page = process * kPage; page < size; page += processes * 2 * kPage) {
-                touch(anonymous + page, kPage);
-            }
+            touchEvery(processes * 2 * kPage, anonymous + process * kPage, size - process * kPage);
         });
     }
 }
@@ -253,7 +254,7 @@ void orphansOfExec(const Arguments& arguments) {
     for (size_t child = 0; child < arguments.count(1); ++child) {
         spawn(numbered("child", child), [=] { touch(memory, size); });
     }
-    execl("/proc/self/exe", "workload", "plain", "1", nullptr);
+    execl("/proc/self/exe", "workload", "plain 1", nullptr);
     require(false, "exec");
 }
 
@@ -279,11 +280,9 @@ void withoutFirstThread(const Arguments& arguments) {
         // The state of a thread that ended is told by its `stat`; there is nothing to wait on.
         const std::string path = "/proc/self/task/" + std::to_string(first) + "/stat";
         for (bool ended = false; !ended; sched_yield()) {
-            std::array<char, 512> text = {};
-            const int file = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-            require(read(file, text.data(), text.size() - 1) > 0, "stat");
-            close(file);
-            ended = std::strstr(text.data(), ") Z ") != nullptr;
+            std::string text;
+            std::getline(std::ifstream(path), text);
+            ended = text.find(") Z ") != std::string::npos;
         }
         reportAs("root");
         say("ready\n");
@@ -344,12 +343,11 @@ const std::map<std::string, void (*)(const Arguments&)> scenarios = {
 
 }  // namespace
 
-int main(int argc, char* argv[]) {
-    const auto scenario = scenarios.find(argc > 1 ? argv[1] : "");
-    if (scenario == scenarios.end()) {
-        return 2;
-    }
-    scenario->second(Arguments({argv + 2, argv + argc}));
+int main(int, char* argv[]) {
+    std::istringstream words(argv[1]);
+    std::string name;
+    words >> name;
+    scenarios.at(name)(Arguments(words));
     reportAs("root");
     say("ready\n");
     waitForEnd();
