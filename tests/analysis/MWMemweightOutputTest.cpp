@@ -92,10 +92,13 @@ namespace {
 class RenamingFormatter : public RecordingFormatter {
 public:
     RenamingFormatter(Lines& log, MWMemoryRegion& region) : RecordingFormatter(log), _region(region) {}
-    void printSharedCategories(const MWCategoryTable& categories, const MWSharedCategoriesCall&) override {
-        _renamed += categories.contains("renamed") ? 1 : 0;
+    void printSharedCategories(const MWCategoryTable& categories,
+                               const MWSharedCategoriesCall& call) override {
+        EXPECT_FALSE(call.hasProcessView);
+        (categories.contains("renamed") ? _renamed : _original) += 1;
         _region.setName("renamed");
     }
+    int _original = 0;
     int _renamed = 0;
 
 private:
@@ -121,6 +124,7 @@ TEST(MWMemweightOutput, TablesOfLargeGroupsAreBuiltOnce) {
         memweight.analyzeData();
         memweight.printOutputVerbose({.verbose = false, .summarize = true});
         EXPECT_EQ(formatter._renamed, builtAgain) << members;
+        EXPECT_EQ(formatter._original, members - builtAgain) << members;
     }
 }
 

@@ -90,6 +90,7 @@ TEST(MWMemweight, JoinsSharedCacheRangesByAddress) {
     const FakeHost host;
     const auto inCache = [](int32_t pid, const RegionLine& own) {
         RegionLine line = own;
+        line.object_id = 5;
         line.size = 8192;
         line.start = 0x7000;
         line.inSharedCache = true;
@@ -120,8 +121,10 @@ TEST(MWMemweight, ObjectsHaveOwnersOnlyWhileThePhysicalChargeIsBrokenDown) {
         EXPECT_EQ(objectOf(other, 0)->ownerPid(), breakDown ? 8 : -1);
     }
     host.selfRegionMemweightError = ENOENT;
+    testing::internal::CaptureStderr();
     MWMemweight::setBreakDownPhysMemweight(true);
     EXPECT_FALSE(MWMemweight::breakDownPhysMemweight());
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 }
 
 TEST(MWMemweight, ChargesDirtyAndSwappedMemory) {

@@ -138,7 +138,8 @@ TEST(MWOutputFormatterText, SharersAreListedUpToTwenty) {
         for (int32_t pid = 1; pid <= members; ++pid) {
             group.addProcess(processes.emplace_back(pid, "p"));
         }
-        const MWSharedCategoriesCall call = {.sharedWith = *group.immutableCopy(),
+        const auto shared = group.immutableCopy();
+        const MWSharedCategoriesCall call = {.sharedWith = *shared,
                                              .forProcess = *std::next(processes.begin()),
                                              .hasProcessView = true,
                                              .total = {}};
@@ -155,21 +156,21 @@ TEST(MWOutputFormatterText, SharersAreListedUpToTwenty) {
 TEST(MWOutputFormatterText, ListsProcessesWithWarningsAndErrors) {
     const FakeProcessSource a(1, "a");
     const FakeProcessSource b(2, "b");
-    const auto lists = [&](const MWProcessErrors& errors) {
-        return printed(kFormatted,
-                       [&](auto& formatter) { formatter.printProcessesWithWarnings({&a}, errors); });
+    using Processes = std::vector<const MWProcess*>;
+    const auto lists = [&](const Processes& failed, const std::vector<std::string>& global) {
+        return printed(kFormatted, [&](auto& formatter) {
+            formatter.printProcessesWithWarnings({&a},
+                                                 {.processesWithErrors = failed, .globalErrors = global});
+        });
     };
     const std::string warnings =
         "\nWarnings were encountered while examining the following processes:\n\ta\n";
-    EXPECT_EQ(lists({.processesWithErrors = {}, .globalErrors = {}}), warnings);
-    EXPECT_EQ(lists({.processesWithErrors = {&b, &a}, .globalErrors = {"stopped\x1b"}}),
+    EXPECT_EQ(lists({}, {}), warnings);
+    EXPECT_EQ(lists({&b, &a}, {"stopped\x1b"}),
               warnings +
                   "\nErrors were encountered while examining the following processes:\n\tb\n\ta\n"
                   "\nErrors were encountered:\n\tstopped?\n"
                   "\nDue to errors, summary results may be invalid\n");
-    EXPECT_EQ(lists({.processesWithErrors = {}, .globalErrors = {"stopped"}}),
-              warnings +
-                  "\nErrors were encountered:\n\tstopped\n\nDue to errors, summary results may be invalid\n");
 }
 
 TEST(MWOutputFormatterText, OneProcessGetsNoSummaryAndEachSampleStartsAnew) {
