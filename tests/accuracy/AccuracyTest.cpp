@@ -130,15 +130,25 @@ TEST_F(Accuracy, WithoutItsFirstThread) {
     expectNear({"without its first thread", measure(process.pids()).summary, scaledBytes(64)}, 2);
 }
 
-// Other processes come and go meanwhile, so the truth is what was in use before or after. With a large tree
-// the kernel's own rounding (its counters are kept for each processor) and what ends just now stay small.
+// Other processes come and go meanwhile, so the truth is what was in use before or after, and a look that
+// fell into a bad moment is repeated. With a large tree the kernel's own rounding (its counters are kept for
+// each processor) stays small.
 TEST_F(Accuracy, WholeSystem) {
+    constexpr double kPercent = 2;
     const Workload tree("fork-tree 768 4 8 0");
-    const uint64_t before = memoryInUse();
-    const Measurement measurement = measureAll();
-    const uint64_t after = memoryInUse();
-    const uint64_t truth = std::clamp(measurement.summary, std::min(before, after), std::max(before, after));
-    expectNear({"all processes", measurement.summary, truth}, 2);
+    uint64_t measured = 0;
+    uint64_t truth = 0;
+    for (int look = 0; look < 3; ++look) {
+        const uint64_t before = memoryInUse();
+        measured = measureAll().summary;
+        const uint64_t after = memoryInUse();
+        truth = std::clamp(measured, std::min(before, after), std::max(before, after));
+        const uint64_t off = std::max(measured, truth) - std::min(measured, truth);
+        if (static_cast<double>(off) * 100 <= static_cast<double>(truth) * kPercent) {
+            break;
+        }
+    }
+    expectNear({"all processes", measured, truth}, kPercent);
 }
 
 TEST_F(Accuracy, AlternatingPagesMakeFewRegions) {
