@@ -1,5 +1,6 @@
 #include "platform/linux/Procfs.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -68,6 +69,22 @@ bool readLink(int directory, const char* path, std::string& target) {
         return false;
     }
     target.assign(buffer.data(), static_cast<size_t>(length));
+    return true;
+}
+
+bool forEachEntry(int parent, const char* path, const std::function<bool(int, const char*)>& visit) {
+    Descriptor list = open(parent, path, O_DIRECTORY);
+    DIR* entries = list ? fdopendir(list.get()) : nullptr;
+    if (entries == nullptr) {
+        return false;
+    }
+    list.release();  // closed with the stream
+    bool goOn = true;
+    while (const dirent* entry = goOn ? readdir(entries) : nullptr) {
+        const std::string_view name = entry->d_name;
+        goOn = name == "." || name == ".." || visit(dirfd(entries), entry->d_name);
+    }
+    closedir(entries);
     return true;
 }
 

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstddef>
+#include <functional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -40,7 +41,12 @@ bool readFile(int directory, const char* path, std::string& text, size_t limit =
 /// The target of a symbolic link; false with errno on failure.
 bool readLink(int directory, const char* path, std::string& target);
 
-/// The namespace of this kind ("ipc", "mnt") of the process with this directory; 0 when it cannot be read.
+/// Visits the entries of a directory, "." and ".." left out, with a descriptor of the directory and the
+/// entry's name, until a visit answers false. False with errno when the directory cannot be opened.
+bool forEachEntry(int parent, const char* path, const std::function<bool(int, const char*)>& visit);
+
+/// The namespace of this kind ("ipc", "mnt", "net") of the process with this directory; 0 when it cannot be
+/// read.
 uint64_t readNamespace(int processDirectory, const std::string& kind);
 
 }  // namespace procfs

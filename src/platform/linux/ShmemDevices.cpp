@@ -26,8 +26,11 @@ std::vector<Mount> parseMountinfo(std::string_view text) {
         std::string_view type = line.substr(separator + 3);
         type = type.substr(0, type.find(' '));
         if (takeNumber(line, id) && takePrefix(line, " ") && takeNumber(line, id) && takePrefix(line, " ") &&
-            takeNumber(line, major) && takePrefix(line, ":") && takeNumber(line, minor)) {
-            mounts.push_back({(major << 32U) | minor, type});
+            takeNumber(line, major) && takePrefix(line, ":") && takeNumber(line, minor) &&
+            takePrefix(line, " ")) {
+            line.remove_prefix(std::min(line.find(' '), line.size()));  // the root within the file system
+            takePrefix(line, " ");
+            mounts.push_back({(major << 32U) | minor, line.substr(0, line.find(' ')), type});
         }
     }
     return mounts;
@@ -40,7 +43,8 @@ ShmemDevices::ShmemDevices() {
     const procfs::Descriptor probe(memfd_create("memweight-probe", MFD_CLOEXEC));
     struct stat status = {};
     if (probe && fstat(probe.get(), &status) == 0) {
-        _isShmem[(uint64_t{major(status.st_dev)} << 32U) | minor(status.st_dev)] = true;
+        _internalDevice = (uint64_t{major(status.st_dev)} << 32U) | minor(status.st_dev);
+        _isShmem[_internalDevice] = true;
     }
 }
 

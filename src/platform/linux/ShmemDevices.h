@@ -12,7 +12,8 @@
 namespace procfs {
 
 struct Mount {
-    uint64_t device = 0;  ///< major << 32 | minor
+    uint64_t device = 0;     ///< major << 32 | minor
+    std::string_view point;  ///< as written, with octal escapes
     std::string_view fileSystem;
 };
 
@@ -28,6 +29,8 @@ class ShmemDevices {
 public:
     ShmemDevices();
 
+    /// The kernel's internal mount, on which SysV segments lie; 0 when it is not known.
+    uint64_t internalDevice() const { return _internalDevice; }
     /// `processDirectory` is where an unknown device is looked up (`mountinfo`). A device that is mounted
     /// nowhere there (the layers of an overlay, for one) counts as a disk, for the processes of that mount
     /// namespace only: what one process cannot see another may have mounted.
@@ -36,6 +39,7 @@ public:
 private:
     std::optional<bool> _known(uint64_t device, uint64_t mountNamespace);
 
+    uint64_t _internalDevice = 0;
     std::mutex _mutex;
     std::unordered_map<uint64_t, bool> _isShmem;
     std::set<std::pair<uint64_t, uint64_t>> _notMounted;  ///< mount namespace and device

@@ -1,9 +1,11 @@
 #include "platform/linux/SmapsParser.h"
 
 #include <array>
+#include <cerrno>
 #include <utility>
 
 #include "platform/linux/ProcText.h"
+#include "platform/linux/Procfs.h"
 
 namespace procfs {
 
@@ -175,6 +177,26 @@ void SmapsParser::_parseField(std::string_view line) {
             return;
         }
     }
+}
+
+// The text of a large process is tens of megabytes, so it is parsed as it comes. The kernel hands out a page
+// of text at a time and lets go of the process's memory map in between.
+bool readMappings(int processDirectory, const char* file, std::vector<Vma>& vmas) {
+    constexpr size_t kBufferSize = 64U << 10U;
+    thread_local std::array<char, kBufferSize> buffer;
+    const Descriptor text = open(processDirectory, file);
+    if (!text) {
+        return false;
+    }
+    SmapsParser parser;
+    ptrdiff_t count = 0;
+    while ((count = readSome(text.get(), buffer)) > 0) {
+        parser.feed({buffer.data(), static_cast<size_t>(count)});
+    }
+    const int error = errno;
+    vmas = parser.finish();
+    errno = error;
+    return count == 0;
 }
 
 std::vector<Vma> parseSmaps(std::string_view text) {

@@ -81,6 +81,9 @@ private:
     size_t _nextField = 0;    ///< the kernel writes fields in one order: look there first
 };
 
+/// The mappings of a process, from its `smaps` or `maps`; false with errno when not all of it could be read.
+bool readMappings(int processDirectory, const char* file, std::vector<Vma>& vmas);
+
 /// All the mappings of a text.
 std::vector<Vma> parseSmaps(std::string_view text);
 

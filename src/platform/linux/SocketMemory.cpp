@@ -1,0 +1,282 @@
+#include "platform/linux/SocketMemory.h"
+
+#include <fcntl.h>
+#include <linux/inet_diag.h>
+#include <linux/netlink.h>
+#include <linux/netlink_diag.h>
+#include <linux/packet_diag.h>
+#include <linux/sock_diag.h>
+#include <linux/unix_diag.h>
+#include <netinet/in.h>
+#include <sched.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <system_error>
+#include <thread>
+#include <vector>
+
+#include "platform/linux/Procfs.h"
+
+namespace sockdiag {
+
+namespace {
+
+using Bytes = std::span<const std::byte>;
+
+/// The structure at the beginning of the bytes; what they are too short for is 0.
+template <class Structure>
+Structure readAs(Bytes bytes) {
+    Structure structure = {};
+    std::memcpy(&structure, bytes.data(), std::min(sizeof(structure), bytes.size()));
+    return structure;
+}
+
+Bytes without(Bytes bytes, size_t count) {
+    return bytes.subspan(std::min(count, bytes.size()));
+}
+
+size_t aligned(size_t length) {
+    return (length + NLA_ALIGNTO - 1) / NLA_ALIGNTO * NLA_ALIGNTO;
+}
+
+/// The attributes of one socket that are read.
+struct Attributes {
+    std::array<uint32_t, SK_MEMINFO_VARS> memory = {};
+    uint64_t unread = 0;  ///< of a local socket
+    bool peerIsGone = false;
+    uint64_t rings =
+        0;  ///< of a packet socket; to its process they are clean pages of a mapping, if anything
+
+    uint64_t bytes(Family family) const {
+        const size_t written = family == Family::tcp ? SK_MEMINFO_WMEM_QUEUED : SK_MEMINFO_WMEM_ALLOC;
+        return uint64_t{memory[SK_MEMINFO_RMEM_ALLOC]} + memory[written] + memory[SK_MEMINFO_OPTMEM] +
+               memory[SK_MEMINFO_BACKLOG] + (peerIsGone ? unread : 0) + rings;
+    }
+};
+
+void readLocal(uint16_t type, Bytes value, Attributes& attributes) {
+    if (type == UNIX_DIAG_MEMINFO) {
+        attributes.memory = readAs<decltype(attributes.memory)>(value);
+    } else if (type == UNIX_DIAG_RQLEN) {
+        attributes.unread = readAs<unix_diag_rqlen>(value).udiag_rqueue;
+    } else if (type == UNIX_DIAG_PEER) {
+        attributes.peerIsGone = readAs<uint32_t>(value) == 0;
+    }
+}
+
+void readPacket(uint16_t type, Bytes value, Attributes& attributes) {
+    if (type == PACKET_DIAG_MEMINFO) {
+        attributes.memory = readAs<decltype(attributes.memory)>(value);
+    } else if (type == PACKET_DIAG_RX_RING || type == PACKET_DIAG_TX_RING) {
+        const auto ring = readAs<packet_diag_ring>(value);
+        attributes.rings += uint64_t{ring.pdr_block_size} * ring.pdr_block_nr;
+    }
+}
+
+uint16_t memoryAttribute(Family family) {
+    if (family == Family::netlink) {
+        return NETLINK_DIAG_MEMINFO;
+    }
+    return INET_DIAG_SKMEMINFO;
+}
+
+void readAttribute(Family family, uint16_t type, Bytes value, Attributes& attributes) {
+    if (family == Family::local) {
+        readLocal(type, value, attributes);
+    } else if (family == Family::packet) {
+        readPacket(type, value, attributes);
+    } else if (type == memoryAttribute(family)) {
+        attributes.memory = readAs<decltype(attributes.memory)>(value);
+    }
+}
+
+Attributes readAttributes(Family family, Bytes bytes) {
+    Attributes attributes;
+    while (bytes.size() >= sizeof(nlattr)) {
+        const auto header = readAs<nlattr>(bytes);
+        const size_t length = std::min<size_t>(header.nla_len, bytes.size());
+        if (length < sizeof(nlattr)) {
+            break;
+        }
+        readAttribute(family, header.nla_type & NLA_TYPE_MASK,
+                      bytes.subspan(sizeof(nlattr), length - sizeof(nlattr)), attributes);
+        bytes = without(bytes, aligned(length));
+    }
+    return attributes;
+}
+
+struct Socket {
+    uint64_t inode;
+    Bytes attributes;
+};
+
+template <class Message>
+Socket socketOf(Bytes bytes, uint32_t Message::*inode) {
+    return {readAs<Message>(bytes).*inode, without(bytes, aligned(sizeof(Message)))};
+}
+
+Socket readSocket(Family family, Bytes bytes) {
+    switch (family) {
+        case Family::tcp:
+        case Family::datagram:
+            return socketOf(bytes, &inet_diag_msg::idiag_inode);
+        case Family::local:
+            return socketOf(bytes, &unix_diag_msg::udiag_ino);
+        case Family::netlink:
+            return socketOf(bytes, &netlink_diag_msg::ndiag_ino);
+        case Family::packet:
+            return socketOf(bytes, &packet_diag_msg::pdiag_ino);
+    }
+    return {};
+}
+
+// Connections that nobody has accepted yet and sockets that nobody holds any more have no inode.
+void addSocket(Family family, Bytes message, SocketBytes& bytes) {
+    const Socket socket = readSocket(family, message);
+    const uint64_t held = readAttributes(family, socket.attributes).bytes(family);
+    if (socket.inode != 0 && held != 0) {
+        bytes[socket.inode] = held;
+    }
+}
+
+}  // namespace
+
+bool readPart(Bytes part, Family family, SocketBytes& bytes) {
+    while (part.size() >= sizeof(nlmsghdr)) {
+        const auto header = readAs<nlmsghdr>(part);
+        const size_t length = std::min<size_t>(header.nlmsg_len, part.size());
+        if (length < sizeof(nlmsghdr) || header.nlmsg_type == NLMSG_DONE ||
+            header.nlmsg_type == NLMSG_ERROR) {
+            return false;
+        }
+        if (header.nlmsg_type == SOCK_DIAG_BY_FAMILY) {
+            addSocket(family, part.subspan(sizeof(nlmsghdr), length - sizeof(nlmsghdr)), bytes);
+        }
+        part = without(part, aligned(length));
+    }
+    return true;
+}
+
+}  // namespace sockdiag
+
+namespace {
+
+using sockdiag::Family;
+
+/// One connection to the kernel's lists of sockets.
+class SocketLists {
+public:
+    explicit SocketLists(procfs::Descriptor connection)
+        : _connection(std::move(connection)), _buffer(kLargestPart) {}
+
+    SocketBytes read() {
+        for (const uint8_t family : {uint8_t{AF_INET}, uint8_t{AF_INET6}}) {
+            _readInternet(Family::tcp, family, IPPROTO_TCP);
+            _readInternet(Family::datagram, family, IPPROTO_UDP);
+            _readInternet(Family::datagram, family, IPPROTO_RAW);
+        }
+        unix_diag_req local = {};
+        local.sdiag_family = AF_UNIX;
+        local.udiag_states = UINT32_MAX;
+        local.udiag_show = UDIAG_SHOW_MEMINFO | UDIAG_SHOW_RQLEN | UDIAG_SHOW_PEER;
+        _read(Family::local, local);
+        netlink_diag_req netlink = {};
+        netlink.sdiag_family = AF_NETLINK;
+        netlink.sdiag_protocol = NDIAG_PROTO_ALL;
+        netlink.ndiag_show = NDIAG_SHOW_MEMINFO;
+        _read(Family::netlink, netlink);
+        packet_diag_req packet = {};
+        packet.sdiag_family = AF_PACKET;
+        packet.pdiag_show = PACKET_SHOW_MEMINFO | PACKET_SHOW_RING_CFG;
+        _read(Family::packet, packet);
+        return std::move(_bytes);
+    }
+
+private:
+    static constexpr size_t kLargestPart = size_t{64} << 10U;
+
+    void _readInternet(Family family, uint8_t addressFamily, uint8_t protocol) {
+        inet_diag_req_v2 request = {};
+        request.sdiag_family = addressFamily;
+        request.sdiag_protocol = protocol;
+        request.idiag_ext = 1U << (INET_DIAG_SKMEMINFO - 1U);
+        request.idiag_states = UINT32_MAX;
+        _read(family, request);
+    }
+
+    template <class Request>
+    void _read(Family family, const Request& request) {
+        struct {
+            nlmsghdr header;
+            Request request;
+        } message = {.header = {.nlmsg_len = sizeof(message),
+                                .nlmsg_type = SOCK_DIAG_BY_FAMILY,
+                                .nlmsg_flags = NLM_F_REQUEST | NLM_F_DUMP,
+                                .nlmsg_seq = 0,
+                                .nlmsg_pid = 0},
+                     .request = request};
+        if (send(_connection.get(), &message, sizeof(message), 0) < 0) {
+            return;
+        }
+        while (_readPart(family)) {
+        }
+    }
+
+    bool _readPart(Family family) {
+        ssize_t count = 0;
+        do {
+            count = recv(_connection.get(), _buffer.data(), _buffer.size(), 0);
+        } while (count < 0 && errno == EINTR);
+        return count > 0 &&
+               sockdiag::readPart(std::span(_buffer).first(static_cast<size_t>(count)), family, _bytes);
+    }
+
+    procfs::Descriptor _connection;
+    std::vector<std::byte> _buffer;
+    SocketBytes _bytes;
+};
+
+// The kernel answers at once; the time limit is for one that does not.
+procfs::Descriptor connectHere() {
+    procfs::Descriptor connection(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_SOCK_DIAG));
+    constexpr timeval kLimit = {.tv_sec = 1, .tv_usec = 0};
+    setsockopt(connection.get(), SOL_SOCKET, SO_RCVTIMEO, &kLimit, sizeof(kLimit));
+    return connection;
+}
+
+// A socket stays in the namespace that it was made in, so a thread that ends again is enough to be there.
+procfs::Descriptor connectIn(const procfs::Descriptor& networkNamespace) {
+    procfs::Descriptor connection;
+    try {
+        std::thread([&] {
+            if (setns(networkNamespace.get(), CLONE_NEWNET) == 0) {
+                connection = connectHere();
+            }
+        }).join();
+    } catch (const std::system_error&) {
+        // No thread to be had.
+    }
+    return connection;
+}
+
+procfs::Descriptor connectToNamespaceOf(int processDirectory) {
+    const uint64_t wanted = procfs::readNamespace(processDirectory, "net");
+    const procfs::Descriptor self = procfs::open(AT_FDCWD, "/proc/thread-self", O_PATH);
+    if (wanted != 0 && wanted == procfs::readNamespace(self.get(), "net")) {
+        return connectHere();
+    }
+    const procfs::Descriptor networkNamespace = procfs::open(processDirectory, "ns/net");
+    return networkNamespace ? connectIn(networkNamespace) : procfs::Descriptor();
+}
+
+}  // namespace
+
+SocketBytes socketBytes(int processDirectory) {
+    procfs::Descriptor connection = connectToNamespaceOf(processDirectory);
+    return connection ? SocketLists(std::move(connection)).read() : SocketBytes();
+}
