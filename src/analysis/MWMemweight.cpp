@@ -4,6 +4,7 @@
 #include <ranges>
 #include <utility>
 
+#include "platform/MWHostInterface.h"
 #include "platform/MWPhysMemweightSwitch.h"
 
 MWMemweight::MWMemweight(MWProcessList processes) : _processes(std::move(processes)) {}
@@ -30,6 +31,7 @@ bool MWMemweight::gatherData() {
     const MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
     const MWProcessList ordered = _processesBySortingPidDesc(_processes);
     _gatherStartTime = MWTime::now();
+    _prepareToGather(queue, ordered);
     std::atomic<bool> stoppedEarly = false;
     queue.apply(ordered.size(), [&](size_t index) {
         if (_earlyExit) {
@@ -44,6 +46,15 @@ bool MWMemweight::gatherData() {
     }
     _gatherEndTime = MWTime::now();
     return stoppedEarly;
+}
+
+void MWMemweight::_prepareToGather(const MWConcurrentQueue& queue, const MWProcessList& processes) const {
+    MWHostInterface::current().beginOwnedVmObjectSurvey();
+    queue.apply(processes.size(), [&](size_t index) {
+        if (!_earlyExit) {
+            processes[index]->prepareToGatherData();
+        }
+    });
 }
 
 void MWMemweight::analyzeData() {

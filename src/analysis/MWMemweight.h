@@ -109,6 +109,8 @@ public:
     static void _totalForCategories(const MWCategoryTable& categories, MWCategoryTotals& outTotal);
 
 private:
+    void _prepareToGather(const MWConcurrentQueue& queue, const MWProcessList& processes) const;
+
     struct Messages {
         MWProcessOrder processesWithWarnings;
         MWProcessOrder processesWithErrors;

@@ -17,3 +17,8 @@ MWHostInterface& MWHostInterface::current() {
 MWHostInterface* MWHostInterface::setCurrent(MWHostInterface* host) {
     return std::exchange(gCurrentHost, host);
 }
+
+const MWLedgerTable& MWHostInterface::ledgerTable() {
+    std::call_once(_ledgerTableRead, [this] { _ledgerTable = MWReadLedgerTable(*this); });
+    return _ledgerTable;
+}

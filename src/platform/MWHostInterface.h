@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <mutex>
 #include <optional>
 #include <span>
 #include <string>
@@ -10,6 +11,7 @@
 #include <vector>
 
 #include "platform/MWHostRecords.h"
+#include "platform/MWLedgerTable.h"
 
 /// One segment of a loaded image, as the image-listing service names it.
 struct MWImageSegmentDescription {
@@ -102,9 +104,16 @@ public:
     /// Fills at most as many records as there is room for; returns 0 and the number filled, or negative.
     virtual int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) = 0;
     virtual int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) = 0;
+    /// What the template says, read on first use and once, whichever thread comes first.
+    const MWLedgerTable& ledgerTable();
 
     // System controls by name.
 
+    /// An object that several processes hold is charged to one of them. To choose it, the host can look at
+    /// all processes of a measurement before it is asked about the first: a measurement begins a survey and
+    /// then has each process that it will ask about looked at.
+    virtual void beginOwnedVmObjectSurvey() {}
+    virtual void surveyOwnedVmObjects(task_t) {}
     /// "vm.get_owned_vmobjects" for a task: the reply's bytes go to `reply` (none asks for the length
     /// alone), `length` is the room on entry and the bytes needed or written on return. ENOENT where the
     /// system has no such control.
@@ -140,4 +149,8 @@ public:
     virtual bool fileExists(const std::string& path) = 0;
     /// Removes `path` if it is a regular file; devices, pipes, links and directories are left alone.
     virtual void unlinkRegularFile(const std::string& path) = 0;
+
+private:
+    std::once_flag _ledgerTableRead;
+    MWLedgerTable _ledgerTable;
 };

@@ -159,17 +159,30 @@ struct ledger_entry_info {
 };
 static_assert(sizeof(ledger_entry_info) == 48);
 
+/// The VM ledger that an owned object is charged to.
+enum MWLedgerTag : uint64_t {
+    MWLedgerDefault = 0,
+    MWLedgerNetwork = 2,
+    MWLedgerMedia = 3,
+    MWLedgerGraphics = 4,
+    MWLedgerNeural = 5,
+};
+
 /// One entry of the reply to "vm.get_owned_vmobjects": an 8-byte entry count, then this record for each
 /// object.
 struct OwnedObjectRecord {
-    uint64_t object_id;  ///< same space as `object_id_full`
-    uint64_t virtual_size;
-    uint64_t resident;
-    uint64_t wired;
-    uint64_t reusable;
-    uint64_t compressed;
-    uint64_t flags;
+    uint64_t object_id = 0;  ///< same space as `object_id_full`
+    uint64_t virtual_size = 0;
+    uint64_t resident = 0;
+    uint64_t wired = 0;
+    uint64_t reusable = 0;
+    uint64_t compressed = 0;
+    uint64_t flags = 0;
 
+    /// The flags of a charged object.
+    static uint64_t flagsFor(MWLedgerTag tag, MWPurgeState state) {
+        return (static_cast<uint64_t>(tag) << 1U) | (static_cast<uint64_t>(state) << 4U);
+    }
     bool notCharged() const { return (flags & 1) != 0; }
     uint64_t ledgerTag() const { return (flags >> 1) & 7; }
     int32_t purgeState() const { return static_cast<int32_t>((flags >> 4) & 3); }

@@ -75,6 +75,8 @@ public:
     virtual uint64_t _gatherPageSize();
     /// Acquires what the source needs to read the process; false when it may not.
     virtual bool _populateTask() { return false; }
+    /// Whatever has to be known of all processes before the first of them is gathered.
+    virtual void prepareToGatherData() {}
     /// Fills `memoryRegions` and the other gathered data.
     virtual void gatherData() {}
     /// None when the process has no auxiliary data.

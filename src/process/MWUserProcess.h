@@ -1,6 +1,7 @@
 #pragma once
 
 #include <array>
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -9,6 +10,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/MWHostRecords.h"
 #include "process/MWImage.h"
@@ -79,8 +81,16 @@ public:
     MWUserProcess(const MWUserProcess&) = delete;
     MWUserProcess& operator=(const MWUserProcess&) = delete;
 
+    /// Has the host look at what the process owns, where it will be asked for it.
+    void prepareToGatherData() override;
     /// Does nothing for a process that has its regions.
     void gatherData() override;
+    /// "phys_memweight" and "phys_memweight_peak", which are not added up over processes; none for a process
+    /// without a charge.
+    MWAuxDataTree auxData() const override;
+    /// What the kernel charges the process in all, in bytes; 0 when it does not tell.
+    uint64_t phys_memweight() const { return _physMemweight; }
+    void setPhys_memweight(uint64_t bytes) { _physMemweight = bytes; }
     bool _isAlive() const override { return true; }
     bool _populateTask() override;
 
@@ -95,12 +105,11 @@ protected:
 
     // Figures of the kernel that no region shows.
 
-    /// Nothing yet: there is no consumer of the physical charge so far.
-    virtual void _gatherPhysMemweight() {}
-    /// Nothing yet: the kernel's ledgers are not read so far, so no page tables are charged.
-    virtual void _gatherLedgers() {}
-    /// None: the kernel does not list owned objects, or is not asked to.
-    virtual std::optional<MWOwnedObjects> _gatherOwnedVmObjects() { return std::nullopt; }
+    /// The charge and its peak; what cannot be read stays as it was.
+    virtual void _gatherPhysMemweight();
+    virtual void _gatherLedgers();
+    /// None when the kernel does not list owned objects, or is not asked to.
+    virtual std::optional<MWOwnedObjects> _gatherOwnedVmObjects();
     virtual void _gatherIdleExitStatus();
     virtual void _setIdleExitStatusFromDirtyFlags(uint32_t flags);
 
@@ -159,6 +168,7 @@ protected:
     uint64_t _sharedRegionBase = 0;
     uint64_t _sharedRegionSize = 0;
     uint32_t _sharedRegionAlignmentSize = 0;  ///< of images inside the shared cache
+    uint64_t _phys_memweight_peak = 0;        ///< over the life of the process, bytes
     /// Bytes of page tables.
     std::array<uint64_t, 1> _ledgers = {};
     /// Present only while gathering.
@@ -176,6 +186,10 @@ private:
     struct SharedPageCharge;
     struct SharedMappingSplit;
     enum class WalkStep : uint8_t { end, region, sharedMapping, notShared };
+
+    /// Owned objects have a use: they are asked for, in this mode, of a process that is displayed.
+    bool _asksForOwnedVmObjects() const;
+    std::optional<std::vector<std::byte>> _fetchOwnedVmObjects();
 
     int _platformCode() const;
     MWSharedText _ownerPath(const MWImageDescription& image) const;
@@ -203,4 +217,6 @@ private:
 
     void _chargeSharedPage(SharedPageCharge& measured, int32_t word);
     void _creditPendingGap(const MWMemoryRegion& nextRegion, int32_t word);
+
+    uint64_t _physMemweight = 0;
 };

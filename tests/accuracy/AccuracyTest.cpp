@@ -119,8 +119,9 @@ TEST_F(Accuracy, IdenticalChildrenOfAParentThatExecs) {
     EXPECT_GE(measure(family.pids()).summary, 16 * scaledBytes(16));
 }
 
+// The page tables are in the charge of one of them alone.
 TEST_F(Accuracy, OneAddressSpaceOfTwoProcesses) {
-    const Workload twins(fmt::format("one-address-space {}", scaled(64)));
+    const Workload twins(fmt::format("one-address-space {}", scaled(128)));
     ASSERT_EQ(twins.pids().size(), 2U);
     expectTrueSums("two processes, one address space", twins.pids());
 }

@@ -1,6 +1,8 @@
 #include "accuracy/PhysicalMemory.h"
 
 #include <fcntl.h>
+#include <linux/kcmp.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -131,6 +133,20 @@ uint64_t mappedShmem() {
     return sum;
 }
 
+bool shareOneAddressSpace(pid_t one, pid_t other) {
+    return syscall(SYS_kcmp, one, other, KCMP_VM, 0, 0) == 0;
+}
+
+uint64_t pageTablesOf(const std::vector<pid_t>& pids) {
+    uint64_t sum = 0;
+    for (auto pid = pids.begin(); pid != pids.end(); ++pid) {
+        const bool isCounted = std::any_of(
+            pids.begin(), pid, [=](pid_t earlier) { return shareOneAddressSpace(earlier, *pid); });
+        sum += isCounted ? 0 : bytesOfLines(directoryOf(*pid) + "status", {"VmPTE"});
+    }
+    return sum;
+}
+
 }  // namespace
 
 uint64_t physicalMemoryOf(const std::vector<pid_t>& pids) {
@@ -140,14 +156,15 @@ uint64_t physicalMemoryOf(const std::vector<pid_t>& pids) {
     }
     makeDistinct(pages.frames);
     makeDistinct(pages.swapEntries);
-    return bytesOf(std::move(pages.frames), isCharged) + pages.swapEntries.size() * kPage;
+    return bytesOf(std::move(pages.frames), isCharged) + pages.swapEntries.size() * kPage +
+           pageTablesOf(pids);
 }
 
 uint64_t chargeOf(pid_t pid) {
     const std::string directory = directoryOf(pid);
     Pages pages;
     addPages(pid, pages);
-    return bytesOfLines(directory + "status", {"RssAnon", "RssShmem", "VmSwap", "HugetlbPages"}) +
+    return bytesOfLines(directory + "status", {"RssAnon", "RssShmem", "VmSwap", "HugetlbPages", "VmPTE"}) +
            bytesOf(std::move(pages.frames), isDirtyFile) -
            bytesOfLines(directory + "smaps_rollup", {"LazyFree"});
 }
@@ -156,8 +173,9 @@ uint64_t memoryInUse() {
     const std::string meminfo = "/proc/meminfo";
     const uint64_t hugePages =
         sumOfLines(meminfo, {"HugePages_Total"}) - sumOfLines(meminfo, {"HugePages_Free"});
-    return bytesOfLines(meminfo, {"AnonPages", "SwapTotal"}) - bytesOfLines(meminfo, {"SwapFree"}) +
-           mappedShmem() + hugePages * bytesOfLines(meminfo, {"Hugepagesize"});
+    return bytesOfLines(meminfo, {"AnonPages", "SwapTotal", "PageTables"}) -
+           bytesOfLines(meminfo, {"SwapFree"}) + mappedShmem() +
+           hugePages * bytesOfLines(meminfo, {"Hugepagesize"});
 }
 
 AddressRange largestMapping(pid_t pid) {

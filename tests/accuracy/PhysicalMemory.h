@@ -10,15 +10,15 @@
 /// code of the program.
 
 /// Every page frame and every swap entry that any of the processes maps, once: anonymous memory that was not
-/// lazily freed, shmem, huge pages and dirty file pages. Without the zero page, clean file pages, page tables
-/// and the swapped part of shmem. Root only.
+/// lazily freed, shmem, huge pages and dirty file pages; and the page tables of each address space. Without the
+/// zero page, clean file pages and the swapped part of shmem. Root only.
 uint64_t physicalMemoryOf(const std::vector<pid_t>& pids);
 
 /// What a process is to be charged, by its `status` and `smaps`: anonymous memory that was not lazily freed,
-/// shmem, swap, huge pages and dirty file pages, each as often as it maps them. Without page tables.
+/// shmem, swap, huge pages and dirty file pages, each as often as it maps them, and its page tables.
 uint64_t chargeOf(pid_t pid);
 
-/// Anonymous memory, mapped shmem, swap and huge pages in use, of the whole system.
+/// Anonymous memory, mapped shmem, swap, huge pages in use and page tables, of the whole system.
 uint64_t memoryInUse();
 
 /// Start and end of the largest mapping.

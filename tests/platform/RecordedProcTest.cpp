@@ -1,44 +1,23 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <string>
 
 #include "platform/linux/MWLinuxHost.h"
 #include "platform/linux/Procfs.h"
 #include "platform/linux/ShmemDevices.h"
+#include "support/RecordedTree.h"
 
 // Trees of recorded files in the place of procfs.
 
 namespace {
 
-class RecordedProc : public testing::Test {
+class RecordedProc : public RecordedTree {
 protected:
-    void SetUp() override { ASSERT_NE(mkdtemp(_top.data()), nullptr); }
-    void TearDown() override { std::filesystem::remove_all(_top); }
-
-    std::filesystem::path place(const std::string& path) {
-        const std::filesystem::path result = _top + "/" + path;
-        std::filesystem::create_directories(result.parent_path());
-        return result;
-    }
-    void write(const std::string& path, const std::string& text) { std::ofstream(place(path)) << text; }
-    void link(const std::string& path, const char* target) {
-        std::filesystem::create_symlink(target, place(path));
-    }
     void writeProcess(const std::string& pid, const std::string& stat, const std::string& smaps) {
         write(pid + "/stat", stat);
         write(pid + "/maps", "");
         write(pid + "/smaps", smaps);
     }
-    procfs::Descriptor directory(const std::string& path) {
-        return procfs::open(AT_FDCWD, (_top + "/" + path).c_str(), O_DIRECTORY);
-    }
-
-    std::string _top = testing::TempDir() + "memweight-proc-XXXXXX";
 };
 
 std::string statOf(int pid, char state, uint64_t flags, int threads) {

@@ -272,3 +272,70 @@ void FakeHost::forEachImage(task_t task, const std::function<void(const MWImageD
         block(FakeImageCursor(image));
     }
 }
+
+int FakeHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
+    const FakeProcess* process = _find(pid);
+    if (process == nullptr || !process->usage) {
+        return _fail(ESRCH);
+    }
+    record = *process->usage;
+    return 0;
+}
+
+int FakeHost::ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) {
+    _count("ledgerTemplate");
+    if (ledgerTemplateError != 0) {
+        return _fail(ledgerTemplateError);
+    }
+    filled = std::min(records.size(), ledgerNames.size());
+    for (size_t index = 0; index < filled; ++index) {
+        copyText(records[index].lti_name, ledgerNames[index]);
+    }
+    return 0;
+}
+
+int FakeHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) {
+    const FakeProcess& process = processes.at(pid);
+    if (process.ledgerError != 0) {
+        return _fail(process.ledgerError);
+    }
+    filled = std::min(records.size(), process.ledgerBalances.size());
+    for (size_t index = 0; index < filled; ++index) {
+        records[index].lei_balance = process.ledgerBalances[index];
+    }
+    return 0;
+}
+
+void FakeHost::surveyOwnedVmObjects(task_t task) {
+    const std::lock_guard lock(_mutex);
+    surveyed.insert(task);
+}
+
+int FakeHost::sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) {
+    const FakeProcess& process = processes.at(pidOfTask(task));
+    const bool isFetch = !reply.empty();
+    if (isFetch) {
+        const std::lock_guard lock(_mutex);
+        ownedFetches.push_back(reply.size());
+    }
+    if (const int error =
+            isFetch && process.ownedFetchError != 0 ? process.ownedFetchError : process.ownedError) {
+        return _fail(error);
+    }
+    const uint64_t count =
+        isFetch ? process.owned.size() : process.ownedAtFirst.value_or(process.owned.size());
+    std::vector<std::byte> bytes(count == 0 ? 0 : sizeof(count) + count * sizeof(OwnedObjectRecord));
+    if (!bytes.empty()) {
+        std::memcpy(bytes.data(), &count, sizeof(count));
+        std::memcpy(bytes.data() + sizeof(count), process.owned.data(), bytes.size() - sizeof(count));
+    }
+    if (ownedReplyIsCut) {
+        bytes.pop_back();
+    }
+    length = isFetch ? std::min(reply.size(), bytes.size()) : bytes.size();
+    std::copy_n(bytes.begin(), isFetch ? length : 0, reply.begin());
+    if (isFetch && ownedReplyIsEndless) {
+        length = reply.size();
+    }
+    return 0;
+}

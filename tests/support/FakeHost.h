@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -45,6 +46,13 @@ struct FakeProcess {
     kern_return_t pageQueryFailure = KERN_SUCCESS;
     bool gone = false;  ///< proc_pidinfo fails with ESRCH
     uint32_t dirtyFlags = 0;
+    std::optional<rusage_info_v5> usage = {};
+    std::vector<int64_t> ledgerBalances = {};
+    int ledgerError = 0;                        ///< errno of the entry query, 0 for success
+    std::vector<OwnedObjectRecord> owned = {};  ///< the reply; empty for one of no bytes
+    std::optional<size_t> ownedAtFirst = {};    ///< how many the length query knows of; all
+    int ownedError = ENOENT;                    ///< errno of both queries, 0 for success
+    int ownedFetchError = 0;
 };
 
 /// The system on a page: a test fills `processes` and reads back what was asked. Installs itself as the
@@ -70,8 +78,15 @@ public:
     std::set<std::string> files;  ///< existing paths
     std::map<uint32_t, std::string> tagDescriptions;
 
+    std::vector<std::string> ledgerNames;
+    int ledgerTemplateError = 0;
+    bool ownedReplyIsCut = false;      ///< it is shorter than its count says
+    bool ownedReplyIsEndless = false;  ///< it fills any buffer
+
     std::vector<std::string> unlinked;
-    std::vector<std::string> machErrors;                     ///< "LABEL: CODE" of each mach_error
+    std::set<task_t> surveyed;            ///< since the last survey began
+    std::vector<size_t> ownedFetches;     ///< room of each fetch of owned objects, in bytes
+    std::vector<std::string> machErrors;  ///< "LABEL: CODE" of each mach_error
     std::vector<std::pair<uint64_t, uint64_t>> pageQueries;  ///< (start, pages) of each page-range query
     std::set<task_t> openTasks;
     /// How often the operation of this name was asked.
@@ -92,16 +107,18 @@ public:
     int proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) override;
     int proc_pidinfo(int32_t pid, proc_bsdinfo& record) override;
     int proc_listallpids(std::span<int32_t> pids) override;
-    int proc_pid_rusage(int32_t, rusage_info_v5&) override { return _fail(ESRCH); }
+    int proc_pid_rusage(int32_t pid, rusage_info_v5& record) override;
     int proc_get_dirty(int32_t pid, uint32_t& flags) override;
     int sysctlArgumentMaximum(uint64_t& bytes) override {
         bytes = 4096;
         return 0;
     }
     int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
-    int ledgerTemplate(std::span<ledger_template_info>, size_t&) override { return _fail(ENOTSUP); }
-    int ledgerEntries(int32_t, std::span<ledger_entry_info>, size_t&) override { return _fail(ENOTSUP); }
-    int sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) override { return _fail(ENOENT); }
+    int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
+    int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
+    void beginOwnedVmObjectSurvey() override { surveyed.clear(); }
+    void surveyOwnedVmObjects(task_t task) override;
+    int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;
     uint64_t vm_kernel_page_size() override { return pageSize; }

@@ -1,13 +1,12 @@
 #include "platform/linux/LinuxTask.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <string>
+#include <unordered_set>
 #include <utility>
 
 #include "platform/linux/SmapsParser.h"
@@ -36,22 +35,15 @@ struct LiveThread {
 
 // A thread of the process that has not ended; without a directory when there is none left.
 LiveThread openLiveThread(int processDirectory) {
-    procfs::Descriptor list = procfs::open(processDirectory, "task", O_DIRECTORY);
-    DIR* threads = list ? fdopendir(list.get()) : nullptr;
-    if (threads == nullptr) {
-        return {};
-    }
-    list.release();  // closed with the stream
     LiveThread found;
-    while (const dirent* entry = readdir(threads)) {
-        procfs::Descriptor thread = openDirectory(dirfd(threads), entry->d_name);
-        const auto stat = entry->d_name[0] == '.' || !thread ? std::nullopt : readStat(thread.get());
+    procfs::forEachEntry(processDirectory, "task", [&](int threads, const char* name) {
+        procfs::Descriptor thread = openDirectory(threads, name);
+        const auto stat = thread ? readStat(thread.get()) : std::nullopt;
         if (stat && !stat->threadEnded()) {
             found = {stat->pid, std::move(thread)};
-            break;
         }
-    }
-    closedir(threads);
+        return !found.directory;
+    });
     return found;
 }
 
@@ -67,6 +59,10 @@ LinuxRun::LinuxRun(const std::string& procDirectory)
     : proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
       pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
       identity(bootId(proc.get())),
+      ownedObjects({.proc = proc.get(),
+                    .pageSize = pageSize,
+                    .shmemDevice = shmemDevices.internalDevice(),
+                    .identity = identity}),
       frames(procfs::open(proc.get(), "kpageflags")),
       untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)) {}
 
@@ -103,26 +99,6 @@ bool LinuxTask::_chooseThread() {
     return static_cast<bool>(_thread);
 }
 
-// The text of a large process is tens of megabytes, so it is parsed as it comes. The kernel hands out a page
-// of text at a time and lets go of the process's memory map in between.
-bool LinuxTask::_parseSmaps(std::vector<procfs::Vma>& vmas) const {
-    constexpr size_t kBufferSize = 64U << 10U;
-    thread_local std::array<char, kBufferSize> buffer;
-    const procfs::Descriptor file = procfs::open(_memoryDirectory(), "smaps");
-    if (!file) {
-        return false;
-    }
-    procfs::SmapsParser parser;
-    ptrdiff_t count = 0;
-    while ((count = procfs::readSome(file.get(), buffer)) > 0) {
-        parser.feed({buffer.data(), static_cast<size_t>(count)});
-    }
-    const int error = errno;
-    vmas = parser.finish();
-    errno = error;
-    return count == 0;
-}
-
 // A text that a thread's end or its exec cuts short ends like any other, so the thread is looked at before
 // and after: when it has ended another one is asked, when it runs another program the text is read again.
 kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) {
@@ -132,7 +108,7 @@ kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t&
             return MACH_SEND_INVALID_DEST;
         }
         const auto before = readStat(_memoryDirectory());
-        const bool read = _parseSmaps(vmas);
+        const bool read = procfs::readMappings(_memoryDirectory(), "smaps", vmas);
         if (!read && errno != ESRCH) {
             return KERN_FAILURE;
         }
@@ -195,6 +171,41 @@ void LinuxTask::_checkFamilyMemory() {
         _warnings.push_back("Memory shared by fork may be under-counted by " +
                             std::to_string(parts - joined) + " bytes: page frames are hidden (try as root?)");
     }
+}
+
+bool LinuxTask::sharesAnothersSpace() {
+    const auto stat = readStat(_memoryDirectory());
+    return stat && _run.sharedSpaces.ownerOf(_candidate(stat->startStack)).pid != _pid;
+}
+
+void LinuxTask::surveyOwnedObjects() {
+    _run.ownedObjects.add({_pid, _startTime}, _memoryDirectory());
+}
+
+// An object is left to the region walk where that shows it. A mapping whose pages the process has not touched
+// shows nothing.
+std::vector<OwnedObjectRecord> LinuxTask::ownedObjects() {
+    const ProcessIdentity process = {_pid, _startTime};
+    if (!_run.ownedObjects.knows(process)) {
+        surveyOwnedObjects();
+    }
+    std::optional<std::unordered_set<uint64_t>> shown;
+    return _run.ownedObjects.objectsOf(process, [&](uint64_t identifier) {
+        if (!shown) {
+            shown = _shownObjects();
+        }
+        return shown->contains(identifier);
+    });
+}
+
+std::unordered_set<uint64_t> LinuxTask::_shownObjects() {
+    std::unordered_set<uint64_t> shown;
+    if (takeSnapshot() == KERN_SUCCESS) {
+        for (const AddressSpaceRegion& region : _space->regions()) {
+            shown.insert(region.info.object_id_full);
+        }
+    }
+    return shown;
 }
 
 void LinuxTask::dropSnapshot() {

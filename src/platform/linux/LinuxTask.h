@@ -5,12 +5,14 @@
 #include <optional>
 #include <span>
 #include <string>
+#include <unordered_set>
 #include <utility>
 #include <vector>
 
 #include "platform/MWHostRecords.h"
 #include "platform/linux/AddressSpace.h"
 #include "platform/linux/LivePages.h"
+#include "platform/linux/OwnedObjectSurvey.h"
 #include "platform/linux/PageDispositions.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
@@ -27,6 +29,7 @@ struct LinuxRun {
     RegionNames names;
     ForkFamilies families;
     SharedAddressSpaces sharedSpaces;
+    OwnedObjectSurvey ownedObjects;
     PageFrameFlags frames;
     PagemapEntry untouchedPage;  ///< of this process, to know the zero page by
 
@@ -65,6 +68,13 @@ public:
     /// snapshot. KERN_INVALID_ARGUMENT when the process has ended.
     kern_return_t fillDispositions(uint64_t start, std::span<int32_t> words);
 
+    /// Whether its memory goes under another process's name, with which it shares one address space.
+    bool sharesAnothersSpace();
+    /// Looks at what the process holds through descriptors, for the choice of owners.
+    void surveyOwnedObjects();
+    /// What the process is charged for beside its regions. May take a snapshot.
+    std::vector<OwnedObjectRecord> ownedObjects();
+
 private:
     LinuxTask(LinuxRun& run, int32_t pid);
 
@@ -72,8 +82,8 @@ private:
     int _memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
     /// False when no thread of the process lives.
     bool _chooseThread();
-    bool _parseSmaps(std::vector<procfs::Vma>& vmas) const;
     kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack);
+    std::unordered_set<uint64_t> _shownObjects();
     bool _readEntries(const AddressSpaceRegion& region, uint64_t address);
     SharedAddressSpaces::Candidate _candidate(uint64_t startStack) const {
         return {{_pid, _startTime}, _threadId, startStack};

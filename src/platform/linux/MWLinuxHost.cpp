@@ -9,6 +9,7 @@
 #include <array>
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <ctime>
 #include <iterator>
 #include <optional>
@@ -203,10 +204,29 @@ void MWLinuxHost::forEachImage(task_t task, const std::function<void(const MWIma
     }
 }
 
-// The control belongs to a kernel that keeps lists of owned objects; this one does not.
-int MWLinuxHost::sysctlOwnedVmObjects(task_t, std::span<std::byte>, size_t&) {
-    errno = ENOENT;
-    return -1;
+void MWLinuxHost::surveyOwnedVmObjects(task_t task) {
+    if (LinuxTask* record = _task(task)) {
+        record->surveyOwnedObjects();
+    }
+}
+
+// An 8-byte count, then the records.
+int MWLinuxHost::sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) {
+    LinuxTask* record = _task(task);
+    if (record == nullptr) {
+        errno = ESRCH;
+        return -1;
+    }
+    const std::vector<OwnedObjectRecord> objects = record->ownedObjects();
+    const uint64_t count = objects.size();
+    std::vector<std::byte> bytes(objects.empty() ? 0 : sizeof(count) + count * sizeof(OwnedObjectRecord));
+    if (!bytes.empty()) {
+        std::memcpy(bytes.data(), &count, sizeof(count));
+        std::memcpy(bytes.data() + sizeof(count), objects.data(), count * sizeof(OwnedObjectRecord));
+    }
+    length = reply.empty() ? bytes.size() : std::min(reply.size(), bytes.size());
+    std::copy_n(bytes.begin(), std::min(reply.size(), bytes.size()), reply.begin());
+    return 0;
 }
 
 int MWLinuxHost::sysctlSelfRegionMemweight(int32_t& value) {

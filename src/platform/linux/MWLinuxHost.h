@@ -57,10 +57,13 @@ public:
     int sysctlArgumentMaximum(uint64_t& bytes) override;
     int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
 
-    /// One entry, "page_table"; its balance is VmPTE.
+    /// One entry, "page_table"; its balance is VmPTE, or 0 where another process is charged for the space.
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
 
+    void beginOwnedVmObjectSurvey() override { _run.ownedObjects.begin(); }
+    void surveyOwnedVmObjects(task_t task) override;
+    /// What the process holds through descriptors, and its SysV segments that nobody has attached.
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;

@@ -1,4 +1,3 @@
-#include <dirent.h>
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -55,20 +54,13 @@ uint64_t physicalCharge(const procfs::ProcStatus& status) {
 
 std::vector<int32_t> numericEntries(int procDirectory) {
     std::vector<int32_t> pids;
-    procfs::Descriptor list = procfs::open(procDirectory, ".", O_DIRECTORY);
-    DIR* entries = list ? fdopendir(list.get()) : nullptr;
-    if (entries == nullptr) {
-        return pids;
-    }
-    list.release();  // closed with the stream
-    while (const dirent* entry = readdir(entries)) {
-        std::string_view name = entry->d_name;
+    procfs::forEachEntry(procDirectory, ".", [&](int, std::string_view name) {
         int32_t pid = 0;
         if (procfs::takeNumber(name, pid) && name.empty()) {
             pids.push_back(pid);
         }
-    }
-    closedir(entries);
+        return true;
+    });
     std::sort(pids.begin(), pids.end());
     return pids;
 }
@@ -215,6 +207,7 @@ int MWLinuxHost::ledgerTemplate(std::span<ledger_template_info> records, size_t&
     return 0;
 }
 
+// Page tables belong to an address space: of processes that share one, only its owner is charged for them.
 int MWLinuxHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) {
     std::string text;
     filled = 0;
@@ -222,8 +215,10 @@ int MWLinuxHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records
         return -1;
     }
     if (!records.empty()) {
+        LinuxTask* task = _taskOfPid(pid);
+        const bool isCharged = task == nullptr || !task->sharesAnothersSpace();
         records.front() = {};
-        records.front().lei_balance = static_cast<int64_t>(procfs::parseStatus(text).vmPte);
+        records.front().lei_balance = isCharged ? static_cast<int64_t>(procfs::parseStatus(text).vmPte) : 0;
         filled = 1;
     }
     return 0;

@@ -5,6 +5,7 @@
 static_assert(crypto_shorthash_KEYBYTES == 16 && crypto_shorthash_BYTES == 8);
 
 namespace {
+// Those of Unmapped go on from here.
 enum Kind : uint64_t { kFile = 1, kSysV = 2, kProcess = 3, kFamily = 4 };
 }  // namespace
 
@@ -35,6 +36,10 @@ uint64_t ObjectIdentity::process(int32_t pid, uint64_t startTime, uint64_t addre
 uint64_t ObjectIdentity::family(const FamilyMemory& memory) const {
     const uint64_t detail = (uint64_t{memory.tag} << 32U) | memory.generation;
     return _hash({kFamily, memory.family, memory.window, memory.file, detail});
+}
+
+uint64_t ObjectIdentity::unmapped(Unmapped kind, uint64_t first, uint64_t second) const {
+    return _hash({static_cast<uint64_t>(kind), first, second, 0});
 }
 
 uint64_t ObjectIdentity::_hash(std::initializer_list<uint64_t> what) const {

@@ -29,6 +29,9 @@ public:
         uint32_t generation;
     };
     uint64_t family(const FamilyMemory& memory) const;
+    /// What no mapping shows; `first` and `second` name the object among those of its kind.
+    enum class Unmapped : uint64_t { socket = 5, socketsOfProcess, bpfMap, drmClient };
+    uint64_t unmapped(Unmapped kind, uint64_t first, uint64_t second) const;
     /// Any bytes; cannot be undone.
     uint64_t bytes(std::string_view bytes) const;
 

@@ -1,0 +1,241 @@
+#include "platform/linux/HeldObjects.h"
+
+#include <fcntl.h>
+#include <linux/magic.h>
+#include <sys/stat.h>
+#include <sys/statfs.h>
+#include <sys/syscall.h>
+#include <sys/sysinfo.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <optional>
+
+#include "platform/linux/Fdinfo.h"
+#include "platform/linux/ProcText.h"
+#include "platform/linux/Procfs.h"
+
+namespace {
+
+// Newer than the C library's headers.
+constexpr long kCachestatCall = 451;  // Linux 6.5
+struct CachestatRange {
+    uint64_t offset;
+    uint64_t length;  ///< 0 for up to the end
+};
+struct Cachestat {
+    uint64_t cached;
+    uint64_t dirty;
+    uint64_t writeback;
+    uint64_t evicted;
+    uint64_t recentlyEvicted;
+};
+
+bool isSwapInUse() {
+    struct sysinfo system = {};
+    return sysinfo(&system) == 0 && system.freeswap != system.totalswap;
+}
+
+// Of the pages of a memory file, the bytes that are in swap. Asked only where there is something in swap at
+// all, as the file has to be opened for it.
+uint64_t swappedBytes(int directory, const char* path, uint64_t pageSize) {
+    if (!isSwapInUse()) {
+        return 0;
+    }
+    const procfs::Descriptor file = procfs::open(directory, path, O_NONBLOCK | O_NOCTTY);
+    CachestatRange range = {.offset = 0, .length = 0};
+    Cachestat pages = {};
+    const bool known = file && syscall(kCachestatCall, file.get(), &range, &pages, 0) == 0;
+    return known ? pages.evicted * pageSize : 0;
+}
+
+std::optional<uint64_t> numberInBrackets(std::string_view text) {
+    uint64_t number = 0;
+    const bool read = procfs::takeNumber(text, number) && text == "]";
+    return read ? std::optional(number) : std::nullopt;
+}
+
+/// The look at one process.
+class Descriptors {
+public:
+    Descriptors(int processDirectory, const DescriptorScan& scan) : _process(processDirectory), _scan(scan) {}
+
+    HeldObjects scan() {
+        procfs::forEachEntry(_process, "fd", [this](int directory, const char* number) {
+            if (procfs::readLink(directory, number, _target)) {
+                _look(directory, number);
+            }
+            return true;
+        });
+        std::erase_if(_objects, [](const auto& entry) {
+            return entry.second.record.resident + entry.second.record.compressed == 0;
+        });
+        return std::move(_objects);
+    }
+
+private:
+    void _look(int directory, const char* number) {
+        const std::string_view target = _target;
+        std::string_view socket = target;
+        if (procfs::takePrefix(socket, "socket:[")) {
+            _addSocket(numberInBrackets(socket).value_or(0));
+        } else if (target == "anon_inode:bpf-map") {
+            _addBpfMap(number);
+        } else if (target.starts_with("/dev/dri/")) {
+            _addDrmClient(number, MWLedgerGraphics);
+        } else if (target.starts_with("/dev/accel/")) {
+            _addDrmClient(number, MWLedgerNeural);
+        } else if (target.starts_with("/dmabuf:")) {
+            _addDmaBuffer(directory, number);
+        } else if (target.starts_with("/memfd:") || (target.starts_with('/') && _mounts().hold(target))) {
+            _addFile(directory, number);
+        }
+    }
+
+    void _addSocket(uint64_t inode) {
+        if (_sockets == nullptr) {
+            _networkNamespace = procfs::readNamespace(_process, "net");
+            _sockets = &_scan.targets.socketsOf(_networkNamespace, _process);
+        }
+        if (const auto found = _sockets->find(inode); inode != 0 && found != _sockets->end()) {
+            _add(_scan.identity.unmapped(ObjectIdentity::Unmapped::socket, _networkNamespace, inode),
+                 MWLedgerNetwork, {.virtual_size = found->second, .resident = found->second});
+        }
+    }
+
+    void _addBpfMap(const char* number) {
+        if (const auto map = procfs::parseBpfMap(_fdinfo(number))) {
+            _add(_scan.identity.unmapped(ObjectIdentity::Unmapped::bpfMap, map->identifier, 0),
+                 MWLedgerDefault, {.virtual_size = map->memory, .resident = map->memory});
+        }
+    }
+
+    void _addDrmClient(const char* number, MWLedgerTag tag) {
+        if (const auto client = procfs::parseDrmClient(_fdinfo(number))) {
+            const uint64_t device = _scan.identity.bytes(client->device);
+            _add(
+                _scan.identity.unmapped(ObjectIdentity::Unmapped::drmClient, device, client->identifier), tag,
+                {.virtual_size = client->total, .resident = client->resident, .reusable = client->purgeable});
+        }
+    }
+
+    void _addDmaBuffer(int directory, const char* number) {
+        const auto buffer = procfs::parseDmaBuffer(_fdinfo(number));
+        const auto file = buffer ? _status(directory, number) : std::nullopt;
+        if (file) {
+            _add(_scan.identity.file(_deviceOf(*file), file->stx_ino),
+                 buffer->fromVideoDevice ? MWLedgerMedia : MWLedgerGraphics,
+                 {.virtual_size = buffer->size, .resident = buffer->size});
+        }
+    }
+
+    void _addFile(int directory, const char* number) {
+        const auto file = _status(directory, number);
+        constexpr uint64_t kBlock = 512;
+        if (!file || !S_ISREG(file->stx_mode) || file->stx_blocks == 0) {
+            return;
+        }
+        const uint64_t bytes = file->stx_blocks * kBlock;
+        OwnedObjectRecord record = {.virtual_size = std::max<uint64_t>(file->stx_size, bytes),
+                                    .resident = bytes};
+        const uint64_t device = _deviceOf(*file);
+        switch (_scan.targets.fileSystemOf(device, directory, number)) {
+            case DescriptorTargets::FileSystem::shmem:
+                record.compressed = std::min(bytes, swappedBytes(directory, number, _scan.pageSize));
+                record.resident -= record.compressed;
+                break;
+            case DescriptorTargets::FileSystem::hugetlb:
+                record.wired = bytes;
+                break;
+            case DescriptorTargets::FileSystem::other:
+                return;
+        }
+        HeldObject& object = _add(_scan.identity.file(device, file->stx_ino), MWLedgerDefault, record);
+        object.device = device;
+        object.inode = file->stx_ino;
+    }
+
+    static uint64_t _deviceOf(const struct statx& file) {
+        return (uint64_t{file.stx_dev_major} << 32U) | file.stx_dev_minor;
+    }
+
+    static std::optional<struct statx> _status(int directory, const char* number) {
+        struct statx file = {};
+        const bool known = statx(directory, number, AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &file) == 0;
+        return known ? std::optional(file) : std::nullopt;
+    }
+
+    HeldObject& _add(uint64_t identifier, MWLedgerTag tag, OwnedObjectRecord record) {
+        record.object_id = identifier;
+        record.flags = OwnedObjectRecord::flagsFor(tag, VM_PURGABLE_DENY);
+        return _objects.insert_or_assign(identifier, HeldObject{.record = record}).first->second;
+    }
+
+    const std::string& _fdinfo(const char* number) {
+        procfs::readFile(_process, (std::string("fdinfo/") + number).c_str(), _text);
+        return _text;
+    }
+
+    const MemoryMounts& _mounts() {
+        if (_knownMounts == nullptr) {
+            _knownMounts = &_scan.targets.mountsOf(_process);
+        }
+        return *_knownMounts;
+    }
+
+    int _process;
+    const DescriptorScan& _scan;
+    HeldObjects _objects;
+    std::string _target;
+    std::string _text;
+    const MemoryMounts* _knownMounts = nullptr;
+    const SocketBytes* _sockets = nullptr;
+    uint64_t _networkNamespace = 0;
+};
+
+}  // namespace
+
+const MemoryMounts& DescriptorTargets::mountsOf(int processDirectory) {
+    constexpr size_t kLongestMountinfo = 64U << 20U;
+    std::string root;
+    procfs::readLink(processDirectory, "root", root);
+    const std::lock_guard lock(_mutex);
+    auto& mounts = _mounts[{procfs::readNamespace(processDirectory, "mnt"), std::move(root)}];
+    if (mounts == nullptr) {
+        std::string text;
+        procfs::readFile(processDirectory, "mountinfo", text, kLongestMountinfo);
+        mounts = std::make_unique<const MemoryMounts>(text);
+    }
+    return *mounts;
+}
+
+const SocketBytes& DescriptorTargets::socketsOf(uint64_t networkNamespace, int processDirectory) {
+    const std::lock_guard lock(_mutex);
+    auto& sockets = _sockets[networkNamespace];
+    if (sockets == nullptr) {
+        sockets = std::make_unique<const SocketBytes>(socketBytes(processDirectory));
+    }
+    return *sockets;
+}
+
+DescriptorTargets::FileSystem DescriptorTargets::fileSystemOf(uint64_t device, int directory,
+                                                              const char* path) {
+    const std::lock_guard lock(_mutex);
+    const auto [known, isNew] = _fileSystems.try_emplace(device, FileSystem::other);
+    if (isNew) {
+        const procfs::Descriptor file = procfs::open(directory, path, O_PATH);
+        struct statfs status = {};
+        if (file && fstatfs(file.get(), &status) == 0) {
+            const bool isHugetlb = status.f_type == HUGETLBFS_MAGIC;
+            known->second = status.f_type == TMPFS_MAGIC
+                                ? FileSystem::shmem
+                                : (isHugetlb ? FileSystem::hugetlb : FileSystem::other);
+        }
+    }
+    return known->second;
+}
+
+HeldObjects heldObjects(int processDirectory, const DescriptorScan& scan) {
+    return Descriptors(processDirectory, scan).scan();
+}

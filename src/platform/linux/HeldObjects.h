@@ -1,0 +1,62 @@
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <utility>
+
+#include "platform/MWHostRecords.h"
+#include "platform/linux/MemoryMounts.h"
+#include "platform/linux/ObjectIdentity.h"
+#include "platform/linux/SocketMemory.h"
+
+/// A kernel object that a process holds through a descriptor. A socket's record has its bytes alone: sockets
+/// are reported in one sum.
+struct HeldObject {
+    OwnedObjectRecord record = {};
+    // Of a file, which others can map; 0 for everything else.
+    uint64_t device = 0;  ///< major << 32 | minor
+    uint64_t inode = 0;
+
+    bool isSocket() const { return record.ledgerTag() == MWLedgerNetwork; }
+    bool canBeMapped() const { return inode != 0; }
+};
+
+/// By `object_id`.
+using HeldObjects = std::unordered_map<uint64_t, HeldObject>;
+
+/// What the descriptors of many processes lead to alike, looked up when the first of them does. Safe for use
+/// from several threads.
+class DescriptorTargets {
+public:
+    enum class FileSystem : uint8_t { other, shmem, hugetlb };
+
+    /// Of the mount namespace of the process with this directory, seen from its root.
+    const MemoryMounts& mountsOf(int processDirectory);
+    /// Of the network namespace with this number, in which the process is.
+    const SocketBytes& socketsOf(uint64_t networkNamespace, int processDirectory);
+    /// The file system with this device number; `path` leads to a file on it and is not opened for more than
+    /// the question.
+    FileSystem fileSystemOf(uint64_t device, int directory, const char* path);
+
+private:
+    std::mutex _mutex;
+    std::map<std::pair<uint64_t, std::string>, std::unique_ptr<const MemoryMounts>> _mounts;
+    std::map<uint64_t, std::unique_ptr<const SocketBytes>> _sockets;
+    std::map<uint64_t, FileSystem> _fileSystems;
+};
+
+struct DescriptorScan {
+    DescriptorTargets& targets;
+    const ObjectIdentity& identity;
+    uint64_t pageSize;
+};
+
+/// Everything that holds memory behind the descriptors of a process, as far as the caller may look. Costs one
+/// readlink for each descriptor; a file is looked at only where it lies in memory, so that no dead server can
+/// hold the scan up, and nothing that can be told from outside happens to any of them.
+HeldObjects heldObjects(int processDirectory, const DescriptorScan& scan);

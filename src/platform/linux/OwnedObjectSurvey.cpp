@@ -1,0 +1,150 @@
+#include "platform/linux/OwnedObjectSurvey.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <ctime>
+#include <string>
+
+#include "platform/linux/ProcText.h"
+#include "platform/linux/Procfs.h"
+#include "platform/linux/SmapsParser.h"
+
+namespace {
+
+uint64_t secondsOf(clockid_t clock) {
+    timespec time = {};
+    clock_gettime(clock, &time);
+    return static_cast<uint64_t>(time.tv_sec);
+}
+
+// A creator's pid can have been given to another process since, which is then younger than the segment.
+bool canHaveMade(const ProcessIdentity& process, const procfs::SysVSegment& segment) {
+    constexpr uint64_t kRounding = 2;
+    const auto ticksPerSecond = static_cast<uint64_t>(sysconf(_SC_CLK_TCK));
+    const uint64_t booted = secondsOf(CLOCK_REALTIME) - secondsOf(CLOCK_BOOTTIME);
+    return process.pid == segment.creator &&
+           booted + process.startTime / ticksPerSecond <= segment.changeTime + kRounding;
+}
+
+bool isStill(const ProcessIdentity& process, int directory) {
+    std::string text;
+    const auto stat = procfs::readFile(directory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
+    return stat && stat->startTime == process.startTime;
+}
+
+}  // namespace
+
+void OwnedObjectSurvey::begin() {
+    const std::lock_guard lock(_mutex);
+    _holdersOfObject.clear();
+    _holders.clear();
+    _segments.reset();
+    _targets = std::make_unique<DescriptorTargets>();
+}
+
+void OwnedObjectSurvey::add(const ProcessIdentity& process, int directory) {
+    auto holder = std::make_unique<Holder>(Holder{
+        .process = process,
+        .objects = heldObjects(directory, {*_targets, _system.identity, _system.pageSize}),
+    });
+    const std::lock_guard lock(_mutex);
+    _addSysVSegments(*holder);
+    auto& known = _holders[process];
+    if (known != nullptr) {
+        return;
+    }
+    for (const auto& [identifier, object] : holder->objects) {
+        _holdersOfObject[identifier].push_back(holder.get());
+    }
+    known = std::move(holder);
+}
+
+bool OwnedObjectSurvey::knows(const ProcessIdentity& process) const {
+    const std::lock_guard lock(_mutex);
+    return _holders.contains(process);
+}
+
+void OwnedObjectSurvey::_readSysVSegments() {
+    constexpr size_t kLongestList = 64U << 20U;
+    std::string text;
+    procfs::readFile(_system.proc, "sysvipc/shm", text, kLongestList);
+    _segments = procfs::parseSysVSegments(text);
+    _ipcNamespace = procfs::readNamespace(procfs::open(_system.proc, "self", O_PATH).get(), "ipc");
+}
+
+void OwnedObjectSurvey::_addSysVSegments(Holder& holder) {
+    if (!_segments) {
+        _readSysVSegments();
+    }
+    for (const procfs::SysVSegment& segment : *_segments) {
+        if (segment.attached != 0 || segment.resident + segment.swapped == 0 ||
+            !canHaveMade(holder.process, segment)) {
+            continue;
+        }
+        const OwnedObjectRecord record = {
+            .object_id = _system.identity.sysV(_system.shmemDevice, segment.identifier, _ipcNamespace),
+            .virtual_size = segment.size,
+            .resident = segment.resident,
+            .compressed = segment.swapped,
+            .flags = OwnedObjectRecord::flagsFor(MWLedgerDefault, VM_PURGABLE_DENY)};
+        holder.objects.emplace(record.object_id, HeldObject{.record = record});
+    }
+}
+
+bool OwnedObjectSurvey::_maps(Holder& holder, const HeldObject& object) const {
+    if (!holder.mappedFiles) {
+        holder.mappedFiles.emplace();
+        const procfs::Descriptor directory =
+            procfs::open(_system.proc, std::to_string(holder.process.pid).c_str(), O_PATH | O_DIRECTORY);
+        std::vector<procfs::Vma> vmas;
+        if (directory && isStill(holder.process, directory.get())) {
+            procfs::readMappings(directory.get(), "maps", vmas);
+        }
+        for (const procfs::Vma& vma : vmas) {
+            holder.mappedFiles->emplace(vma.device(), vma.inode);
+        }
+    }
+    return holder.mappedFiles->contains({object.device, object.inode});
+}
+
+bool OwnedObjectSurvey::_isCharged(const Holder& holder, const HeldObject& object) {
+    return std::ranges::all_of(_holdersOfObject[object.record.object_id], [&](Holder* other) {
+        if (other == &holder) {
+            return true;
+        }
+        return ByIdentity()(holder.process, other->process) &&
+               !(object.canBeMapped() && _maps(*other, object));
+    });
+}
+
+std::vector<OwnedObjectRecord> OwnedObjectSurvey::objectsOf(const ProcessIdentity& process,
+                                                            const IsMapped& isMapped) {
+    const std::lock_guard lock(_mutex);
+    const auto found = _holders.find(process);
+    if (found == _holders.end()) {
+        return {};
+    }
+    std::vector<OwnedObjectRecord> records;
+    uint64_t socketBytes = 0;
+    for (const auto& [identifier, object] : found->second->objects) {
+        if ((object.canBeMapped() && isMapped(identifier)) || !_isCharged(*found->second, object)) {
+            continue;
+        }
+        if (object.isSocket()) {
+            socketBytes += object.record.resident;
+        } else {
+            records.push_back(object.record);
+        }
+    }
+    if (socketBytes != 0) {
+        records.push_back(
+            {.object_id = _system.identity.unmapped(ObjectIdentity::Unmapped::socketsOfProcess,
+                                                    static_cast<uint64_t>(process.pid), process.startTime),
+             .virtual_size = socketBytes,
+             .resident = socketBytes,
+             .flags = OwnedObjectRecord::flagsFor(MWLedgerNetwork, VM_PURGABLE_DENY)});
+    }
+    return records;
+}

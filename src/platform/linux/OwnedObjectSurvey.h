@@ -1,0 +1,75 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
+#include "platform/MWHostRecords.h"
+#include "platform/linux/HeldObjects.h"
+#include "platform/linux/SharedAddressSpaces.h"
+#include "platform/linux/SysVSegments.h"
+
+/// Decides which process is charged for an object that no mapping shows: the oldest of those that hold it,
+/// unless one of them maps it; a SysV segment that nobody has attached is its creator's. For this the
+/// processes of a measurement are looked at before the first of them is asked about. Safe for use from
+/// several threads.
+class OwnedObjectSurvey {
+public:
+    /// `proc` is the root of the procfs, `shmemDevice` the device number that SysV segments have.
+    struct System {
+        int proc;
+        uint64_t pageSize;
+        uint64_t shmemDevice;
+        const ObjectIdentity& identity;
+    };
+    /// The system outlives the survey.
+    explicit OwnedObjectSurvey(const System& system) : _system(system) {}
+
+    /// Forgets what was found: what processes hold changes.
+    void begin();
+    /// Looks at what the process holds; `directory` is where its descriptors are.
+    void add(const ProcessIdentity& process, int directory);
+    bool knows(const ProcessIdentity& process) const;
+
+    /// Whether the region walk of the process itself shows the object; asked of files only.
+    using IsMapped = std::function<bool(uint64_t identifier)>;
+    /// What is reported for a process that was added: an entry for each object, one for all its sockets.
+    std::vector<OwnedObjectRecord> objectsOf(const ProcessIdentity& process, const IsMapped& isMapped);
+
+private:
+    using MappedFiles = std::set<std::pair<uint64_t, uint64_t>>;  ///< device and inode
+    struct Holder {
+        ProcessIdentity process;
+        HeldObjects objects;
+        std::optional<MappedFiles> mappedFiles = {};  ///< read when it is asked for
+    };
+    struct ByIdentity {
+        bool operator()(const ProcessIdentity& one, const ProcessIdentity& other) const {
+            return std::pair(one.startTime, one.pid) < std::pair(other.startTime, other.pid);
+        }
+    };
+    /// Oldest first.
+    using Holders = std::map<ProcessIdentity, std::unique_ptr<Holder>, ByIdentity>;
+
+    void _readSysVSegments();
+    void _addSysVSegments(Holder& holder);
+    bool _isCharged(const Holder& holder, const HeldObject& object);
+    bool _maps(Holder& holder, const HeldObject& object) const;
+
+    System _system;
+
+    mutable std::mutex _mutex;  ///< guards what follows
+    std::unique_ptr<DescriptorTargets> _targets = std::make_unique<DescriptorTargets>();
+    /// Of the tool's own IPC namespace.
+    std::optional<std::vector<procfs::SysVSegment>> _segments;
+    uint64_t _ipcNamespace = 0;
+    Holders _holders;
+    std::unordered_map<uint64_t, std::vector<Holder*>> _holdersOfObject;
+};
