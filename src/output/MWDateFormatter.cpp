@@ -26,7 +26,7 @@ std::string MWDateFormatter::stringFromDate(std::chrono::sys_time<std::chrono::n
     const std::time_t time = std::chrono::system_clock::to_time_t(wholeSeconds);
     std::tm local = {};
     localtime_r(&time, &local);
-    return fmt::format("{:04}-{:02}-{:02} {:02}:{:02}:{:02}.{:03}{}", local.tm_year + 1900, local.tm_mon + 1,
-                       local.tm_mday, local.tm_hour, local.tm_min, local.tm_sec,
+    return fmt::format("{:04}-{:02}-{:02}{}{:02}:{:02}:{:02}.{:03}{}", local.tm_year + 1900, local.tm_mon + 1,
+                       local.tm_mday, _separator, local.tm_hour, local.tm_min, local.tm_sec,
                        (rounded - wholeSeconds).count(), zoneOffset(local.tm_gmtoff));
 }

@@ -52,6 +52,9 @@ public:
     void endAtTime(const MWTime& time) override;
     void startAtTime(const MWTime& time) override;
     void configureForMultipleOutputs() override { _multipleOutputs = true; }
+    /// One line for each region, in the order of the list; also shows, from here on, the rows marked verbose.
+    void printSpanlistLikeOutputForProcess(const MWProcess& process,
+                                           const MWMemoryRegionList& regions) override;
 
     // Internal operations.
 
@@ -72,6 +75,9 @@ private:
         std::string wired;
     };
 
+    /// Rounded up; 0 where the page size is not known.
+    static uint64_t _pagesForSize(uint64_t size, uint64_t pageSize);
+
     bool _shows(MWTextOptions option) const { return (_options & option) != 0; }
     std::string _sizeColumns(const SizeTexts& texts) const;
     void _printTable(const MWCategoryTable& categories, const MWCategoryTotals& total) const;
@@ -80,6 +86,9 @@ private:
     void _printCategories(const MWCategoryTable& categories) const;
     void _printTotalFooter(const MWCategoryTotals& total) const;
     void _printRow(const MWCategoryTotals& total, std::string_view category, std::string_view detail) const;
+
+    std::string _spanlistHeader() const;
+    std::string _spanlistRow(const MWMemoryRegion& region, uint64_t pageSize) const;
 
     void _printSeparator(const char* end) const;
     void _printSharers(const MWSharedCategoriesCall& call) const;
@@ -97,7 +106,7 @@ private:
     std::optional<std::string> _swappedColumnName;
     std::optional<std::string> _wiredColumnName;
     bool _multipleOutputs = false;
-    MWDateFormatter _dateFormatter;
+    MWDateFormatter _dateFormatter{' '};
     /// Rows marked verbose are shown; on for good once a region listing was printed.
     bool _verbose = false;
     MWSummaryFormat _summaryFormat;

@@ -22,10 +22,6 @@ std::string humanized(uint64_t size) {
     return text.data();
 }
 
-uint64_t pagesForSize(uint64_t size, uint64_t pageSize) {
-    return pageSize == 0 ? 0 : (size + pageSize - 1) / pageSize;
-}
-
 struct ColumnWidths {
     int dirty;
     int swapped;
@@ -89,12 +85,16 @@ const std::vector<std::string>& MWSortColumns() {
     return names;
 }
 
+uint64_t MWOutputFormatterText::_pagesForSize(uint64_t size, uint64_t pageSize) {
+    return pageSize == 0 ? 0 : (size + pageSize - 1) / pageSize;
+}
+
 std::string MWOutputFormatterText::formattedStringForSize(uint64_t size) const {
     switch (_summaryFormat) {
         case MWSummaryFormat::bytes:
             return fmt::sprintf("%lld B", static_cast<int64_t>(size));
         case MWSummaryFormat::pages:
-            return fmt::sprintf("%llu pages", pagesForSize(size, _pageSize));
+            return fmt::sprintf("%llu pages", _pagesForSize(size, _pageSize));
         case MWSummaryFormat::formatted:
             break;
     }

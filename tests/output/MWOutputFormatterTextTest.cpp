@@ -220,3 +220,65 @@ TEST(MWOutputFormatterText, OneProcessGetsNoSummaryAndEachSampleStartsAnew) {
     unsetenv("TZ");
     tzset();
 }
+
+TEST(MWOutputFormatterText, RegionsAreListedInPages) {
+    FakeProcessSource process(10, "editor\x1b");
+    process.setPageSize(16384);
+    MWMemoryRegionList regions = {
+        makeRegion({.object_id = 0x123456789AB,
+                    .name = "mapped file",
+                    .detailedName = "/usr/lib/libx.so",
+                    .dirty = 0,
+                    .swapped = 100,
+                    .clean = 16384,
+                    .reclaimable = 16385,
+                    .size = 16385,
+                    .start = 0x7f0000004000,
+                    .wired = true}),
+        makeRegion({.object_id = 7, .name = "page table", .dirty = 4096, .start = UINT64_MAX}),
+    };
+    const auto listing = [&](const MWTextStyle& style) {
+        return printed(style, [&](MWOutputFormatterText& formatter) {
+            formatter.printSpanlistLikeOutputForProcess(process, regions);
+        });
+    };
+    EXPECT_EQ(listing(kFormatted), R"(editor? [10]
+
+           start                end  [objectid]      VRT     DRT     CLN     RCL   tag (detail)
+      ----------         ----------  ----------    -----   -----   -----   -----   ------------
+    7f0000004000 -     7f0000008001 [23456789ab]       2       1       1       2   mapped file .../libx.so
+        unmapped -         unmapped [         7]       1       1       0       0   page table
+
+)");
+    EXPECT_EQ(listing(kBytesWide), R"(editor? [10]
+
+           start                end  [objectid]      VRT     DRT     SWP     CLN     RCL    WIRE   tag (detail)
+      ----------         ----------  ----------    -----   -----   -----   -----   -----   -----   ------------
+    7f0000004000 -     7f0000008001 [23456789ab]       2       1       1       1       2       2   mapped file /usr/lib/libx.so
+        unmapped -         unmapped [         7]       1       1       0       0       0       0   page table
+
+)");
+    process.setPageSize(0);
+    EXPECT_NE(listing(kFormatted).find("]       0       0       0       0   page table\n"),
+              std::string::npos);
+}
+
+TEST(MWOutputFormatterText, AListingShowsTheVerboseRowsFromThenOn) {
+    const FakeProcessSource process(10, "editor");
+    MWCategoryTable table;
+    auto object = std::make_shared<MWMemoryObject>();
+    object->addRegion(makeRegion({.object_id = 3, .name = "reserved", .dirty = 4096, .verbose = true}), 4096);
+    object->finalize();
+    table["reserved"].addMemoryObject(object);
+    const auto shows = [&](bool verbose) {
+        return printed(kFormatted, [&](MWOutputFormatterText& formatter) {
+                   if (verbose) {
+                       formatter.printSpanlistLikeOutputForProcess(process, {});
+                   }
+                   formatter.printProcessHeader(process);
+                   formatter.printProcessCategories(table, {});
+               }).find("reserved") != std::string::npos;
+    };
+    EXPECT_FALSE(shows(false));
+    EXPECT_TRUE(shows(true));
+}

@@ -33,7 +33,7 @@ TEST(MWDateFormatter, WritesLocalTimeWithItsOffset) {
     const auto text = [](const char* zone, int64_t seconds, int64_t nanoseconds) {
         setenv("TZ", zone, 1);
         tzset();
-        return MWDateFormatter().stringFromDate(
+        return MWDateFormatter(' ').stringFromDate(
             MWTime({.wallSeconds = seconds, .wallNanoseconds = nanoseconds}).date());
     };
     constexpr int64_t instant = 1709676429;  // 2024-03-05 22:07:09 UTC

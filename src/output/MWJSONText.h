@@ -1,0 +1,8 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+
+/// Appends `text` as a JSON string, quoted and escaped. Any bytes give a string that every parser takes: each
+/// byte that is not part of well-formed UTF-8 becomes U+FFFD.
+void MWAppendJSONString(std::string& to, std::string_view text);

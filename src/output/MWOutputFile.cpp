@@ -1,0 +1,46 @@
+#include "output/MWOutputFile.h"
+
+#include <fcntl.h>
+#include <fmt/printf.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <system_error>
+#include <utility>
+
+#include "platform/MWTerminalText.h"
+
+std::unique_ptr<MWOutputFile> MWOutputFile::create(const std::string& path) {
+    constexpr mode_t kEverybodyByUmask = 0666;
+    const int descriptor = ::open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, kEverybodyByUmask);
+    return descriptor < 0 ? nullptr : std::unique_ptr<MWOutputFile>(new MWOutputFile(path, descriptor));
+}
+
+MWOutputFile::~MWOutputFile() {
+    if (_descriptor >= 0) {
+        ::close(_descriptor);
+    }
+}
+
+void MWOutputFile::write(std::string_view bytes) {
+    while (!bytes.empty() && _error == 0) {
+        const ssize_t count = ::write(_descriptor, bytes.data(), bytes.size());
+        if (count >= 0) {
+            bytes.remove_prefix(static_cast<size_t>(count));
+        } else if (errno != EINTR) {
+            _error = errno;
+        }
+    }
+}
+
+void MWOutputFile::close() {
+    const bool closed = ::close(std::exchange(_descriptor, -1)) == 0;
+    if (!closed && _error == 0) {
+        _error = errno;
+    }
+    if (_error != 0) {
+        fmt::fprintf(stderr, "memweight: %s: %s\n", MWTerminalText(_path),
+                     std::generic_category().message(_error));
+    }
+}
