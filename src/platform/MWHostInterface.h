@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <span>
@@ -12,6 +13,9 @@
 
 #include "platform/MWHostRecords.h"
 #include "platform/MWLedgerTable.h"
+#include "platform/MWTimer.h"
+
+class MWSerialQueue;
 
 /// One segment of a loaded image, as the image-listing service names it.
 struct MWImageSegmentDescription {
@@ -139,6 +143,12 @@ public:
     /// 0 on success.
     virtual int mach_get_times(MWClockReading& reading) = 0;
     virtual mach_timebase_info_t mach_timebase_info() = 0;
+    /// The monotonic clock that stops while the system sleeps, in nanoseconds; timers go by it.
+    virtual uint64_t uptimeNanoseconds() = 0;
+    /// A timer that is not armed; `handler` is given the number of fires and runs on `queue`, which outlives
+    /// the timer. None with errno where the system has no more timers.
+    virtual std::unique_ptr<MWTimer> makeTimer(MWSerialQueue& queue,
+                                               std::function<void(uint64_t)> handler) = 0;
 
     // The tool's own surroundings.
 

@@ -7,10 +7,13 @@
 
 #include <algorithm>
 #include <atomic>
+#include <semaphore>
 #include <system_error>
 #include <thread>
 #include <utility>
 #include <vector>
+
+#include "platform/MWSignalMask.h"
 
 namespace {
 
@@ -58,4 +61,61 @@ void MWConcurrentQueue::apply(size_t count, const std::function<void(size_t)>& w
             drain();
         }
     }
+}
+
+MWSerialQueue::MWSerialQueue(std::string label, uint32_t qualityOfService) : _label(std::move(label)) {
+    const MWSignalMask mask;
+    _thread = std::thread([this, qualityOfService] { _run(qualityOfService); });
+}
+
+MWSerialQueue::~MWSerialQueue() {
+    {
+        const std::lock_guard lock(_mutex);
+        _ended = true;
+    }
+    _changed.notify_one();
+    _thread.join();
+}
+
+void MWSerialQueue::async(std::function<void()> work) {
+    {
+        const std::lock_guard lock(_mutex);
+        _items.push_back(std::move(work));
+    }
+    _changed.notify_one();
+}
+
+void MWSerialQueue::sync(const std::function<void()>& work) {
+    std::binary_semaphore done(0);
+    async([&] {
+        work();
+        done.release();
+    });
+    done.acquire();
+}
+
+size_t MWSerialQueue::waiting() const {
+    const std::lock_guard lock(_mutex);
+    return _items.size();
+}
+
+void MWSerialQueue::_run(uint32_t qualityOfService) {
+    nameThread(_label);
+    applyQualityOfService(qualityOfService);
+    // An item is destroyed before the next one is waited for: it can hold much.
+    while (std::function<void()> item = _next()) {
+        item();
+    }
+}
+
+/// None at the end of the queue.
+std::function<void()> MWSerialQueue::_next() {
+    std::unique_lock lock(_mutex);
+    _changed.wait(lock, [this] { return _ended || !_items.empty(); });
+    if (_items.empty()) {
+        return nullptr;
+    }
+    std::function<void()> item = std::move(_items.front());
+    _items.pop_front();
+    return item;
 }

@@ -40,6 +40,7 @@ MWUserProcess::~MWUserProcess() {
 
 bool MWUserProcess::_initWithBsdInfo(const proc_bsdinfo& info) {
     setPid(static_cast<int32_t>(info.pbi_pid));
+    _startTime = {info.pbi_start_tvsec, info.pbi_start_tvusec};
     _gatherIsTranslated();
     if (!MWProcess::_initWithBsdInfo(info)) {
         return false;

@@ -10,6 +10,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "platform/MWHostRecords.h"
@@ -85,6 +86,10 @@ public:
     void prepareToGatherData() override;
     /// Does nothing for a process that has its regions.
     void gatherData() override;
+    /// Whether `other` stands for the same process: a pid alone can have been given away.
+    bool isSameProcess(const MWUserProcess& other) const {
+        return pid() == other.pid() && _startTime == other._startTime;
+    }
     /// "phys_memweight" and "phys_memweight_peak", which are not added up over processes; none for a process
     /// without a charge.
     MWAuxDataTree auxData() const override;
@@ -219,4 +224,5 @@ private:
     void _creditPendingGap(const MWMemoryRegion& nextRegion, int32_t word);
 
     uint64_t _physMemweight = 0;
+    std::pair<uint64_t, uint64_t> _startTime;  ///< seconds and microseconds
 };

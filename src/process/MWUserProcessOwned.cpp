@@ -79,8 +79,9 @@ bool MWUserProcess::_asksForOwnedVmObjects() const {
     return _task && !hiddenFromDisplay() && MWPhysMemweightSwitch::isOn();
 }
 
+// Also one that is gathered already: what it holds is not to be charged to another.
 void MWUserProcess::prepareToGatherData() {
-    if (!memoryRegions() && _isAlive() && _asksForOwnedVmObjects()) {
+    if (_isAlive() && _asksForOwnedVmObjects()) {
         MWHostInterface::current().surveyOwnedVmObjects(*_task);
     }
 }

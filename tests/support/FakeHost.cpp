@@ -203,6 +203,7 @@ int FakeHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     record.pbi_status = process->status;
     record.pbi_pid = static_cast<uint32_t>(pid);
     record.pbi_ppid = static_cast<uint32_t>(process->parent);
+    record.pbi_start_tvsec = process->startTime;
     copyText(record.pbi_comm, process->comm);
     copyText(record.pbi_name, process->name);
     return sizeof(record);
@@ -338,4 +339,35 @@ int FakeHost::sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size
         length = reply.size();
     }
     return 0;
+}
+
+FakeTimer::FakeTimer(FakeHost& host, MWSerialQueue& queue, std::function<void(uint64_t)> handler)
+    : _host(host), _queue(queue), _handler(std::move(handler)) {
+    _host.timer = this;
+}
+
+FakeTimer::~FakeTimer() {
+    _host.timer = nullptr;
+}
+
+void FakeTimer::arm(const MWTimerSchedule& schedule) {
+    _host.schedules.push_back(schedule);
+    if (_host.schedules.size() == 1) {
+        _host.timerArmed.release();
+    }
+}
+
+bool FakeTimer::fire(uint64_t fires) {
+    if (!_isCancelled) {
+        _queue.sync([&] { _handler(fires); });
+    }
+    return !_isCancelled;
+}
+
+std::unique_ptr<MWTimer> FakeHost::makeTimer(MWSerialQueue& queue, std::function<void(uint64_t)> handler) {
+    if (noTimers) {
+        errno = EMFILE;
+        return nullptr;
+    }
+    return std::make_unique<FakeTimer>(*this, queue, std::move(handler));
 }

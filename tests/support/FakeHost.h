@@ -1,15 +1,20 @@
 #pragma once
 
+#include <atomic>
 #include <cerrno>
 #include <cstdint>
 #include <map>
 #include <mutex>
 #include <optional>
+#include <semaphore>
 #include <set>
 #include <string>
 #include <vector>
 
 #include "platform/MWHostInterface.h"
+#include "platform/MWWorkQueue.h"
+
+class FakeHost;
 
 /// A region as a test writes it down; `pages` are the disposition words of its pages, missing ones are 0.
 struct FakeRegion {
@@ -46,6 +51,7 @@ struct FakeProcess {
     kern_return_t pageQueryFailure = KERN_SUCCESS;
     bool gone = false;  ///< proc_pidinfo fails with ESRCH
     uint32_t dirtyFlags = 0;
+    uint64_t startTime = 0;  ///< seconds
     std::optional<rusage_info_v5> usage = {};
     std::vector<int64_t> ledgerBalances = {};
     int ledgerError = 0;                        ///< errno of the entry query, 0 for success
@@ -53,6 +59,26 @@ struct FakeProcess {
     std::optional<size_t> ownedAtFirst = {};    ///< how many the length query knows of; all
     int ownedError = ENOENT;                    ///< errno of both queries, 0 for success
     int ownedFetchError = 0;
+};
+
+/// A timer that fires when the test says so.
+class FakeTimer : public MWTimer {
+public:
+    FakeTimer(FakeHost& host, MWSerialQueue& queue, std::function<void(uint64_t)> handler);
+    ~FakeTimer() override;
+    FakeTimer(const FakeTimer&) = delete;
+    FakeTimer& operator=(const FakeTimer&) = delete;
+
+    void arm(const MWTimerSchedule& schedule) override;
+    void cancel() override { _isCancelled = true; }
+    /// Returns when the handler has run; false when the timer is cancelled.
+    bool fire(uint64_t fires = 1);
+
+private:
+    FakeHost& _host;
+    MWSerialQueue& _queue;
+    std::function<void(uint64_t)> _handler;
+    std::atomic<bool> _isCancelled = false;
 };
 
 /// The system on a page: a test fills `processes` and reads back what was asked. Installs itself as the
@@ -72,6 +98,11 @@ public:
     bool processListFails = false;
     MWClockReading clock = {1000, 2000, 978307200, 500000000};
     bool clockFails = false;
+    std::atomic<uint64_t> uptime = 1000;  ///< nanoseconds
+    bool noTimers = false;
+    FakeTimer* timer = nullptr;              ///< while there is one
+    std::vector<MWTimerSchedule> schedules;  ///< of each arming
+    std::binary_semaphore timerArmed = std::binary_semaphore(0);
     int32_t ownPid = 99999;
     uint32_t effectiveUser = 0;
     std::set<int> terminals;
@@ -131,6 +162,8 @@ public:
         return clockFails ? -1 : 0;
     }
     mach_timebase_info_t mach_timebase_info() override { return {1, 1}; }
+    uint64_t uptimeNanoseconds() override { return uptime; }
+    std::unique_ptr<MWTimer> makeTimer(MWSerialQueue& queue, std::function<void(uint64_t)> handler) override;
     int32_t getpid() override { return ownPid; }
     uint32_t geteuid() override { return effectiveUser; }
     bool isatty(int descriptor) override { return terminals.contains(descriptor); }

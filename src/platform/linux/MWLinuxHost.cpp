@@ -16,6 +16,7 @@
 #include <utility>
 
 #include "platform/linux/LinuxTask.h"
+#include "platform/linux/LinuxTimer.h"
 
 namespace {
 
@@ -277,6 +278,14 @@ int MWLinuxHost::mach_get_times(MWClockReading& reading) {
 
 mach_timebase_info_t MWLinuxHost::mach_timebase_info() {
     return {.numer = 1, .denom = 1};
+}
+
+uint64_t MWLinuxHost::uptimeNanoseconds() {
+    return readClock(CLOCK_MONOTONIC);
+}
+
+std::unique_ptr<MWTimer> MWLinuxHost::makeTimer(MWSerialQueue& queue, std::function<void(uint64_t)> handler) {
+    return LinuxTimer::create(queue, std::move(handler));
 }
 
 int32_t MWLinuxHost::getpid() {

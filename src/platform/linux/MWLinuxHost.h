@@ -77,6 +77,8 @@ public:
 
     int mach_get_times(MWClockReading& reading) override;
     mach_timebase_info_t mach_timebase_info() override;
+    uint64_t uptimeNanoseconds() override;
+    std::unique_ptr<MWTimer> makeTimer(MWSerialQueue& queue, std::function<void(uint64_t)> handler) override;
 
     int32_t getpid() override;
     uint32_t geteuid() override;

@@ -41,6 +41,14 @@ proc_bsdinfo kernelRecord() {
     return record;
 }
 
+// Since boot rather than since 1970: exact, whatever is done to the wall clock.
+void setStartTime(proc_bsdinfo& record, uint64_t ticks) {
+    constexpr uint64_t kMicroseconds = 1'000'000;
+    const auto perSecond = static_cast<uint64_t>(sysconf(_SC_CLK_TCK));
+    record.pbi_start_tvsec = ticks / perSecond;
+    record.pbi_start_tvusec = ticks % perSecond * kMicroseconds / perSecond;
+}
+
 // The class byte of the executable.
 bool executableIs64bit(int directory) {
     std::string header;
@@ -140,6 +148,7 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     record.pbi_pid = static_cast<uint32_t>(pid);
     record.pbi_ppid = static_cast<uint32_t>(stat->ppid);
     record.pbi_status = statusOf(*stat, directory);
+    setStartTime(record, stat->startTime);
     copyText(record.pbi_comm, stat->comm);
     procfs::readFile(directory, "cmdline", text);
     copyText(record.pbi_name, procfs::nameFromCommandLine(text));
