@@ -5,10 +5,15 @@
 
 #include <cstdio>
 #include <memory>
+#include <optional>
+#include <string>
 #include <vector>
 
 #include "analysis/MWMemweight.h"
+#include "cli/MWSampling.h"
 #include "cli/MWUsage.h"
+#include "output/MWOutputFormatterJSON.h"
+#include "output/MWOutputFormatterStatpack.h"
 #include "platform/MWHostInterface.h"
 
 namespace {
@@ -33,32 +38,35 @@ int rejectArguments(const MWError& error) {
     return error.domain == MWMemweightError && error.code == MWErrorHelp ? kSuccess : kFailure;
 }
 
-std::vector<const char*> optionsNotBuilt(const MWMemweightArgs& args) {
-    std::vector<const char*> options;
-    if (args.JSONOutputFile()) {
-        options.push_back("--json");
-    }
-    if (args.statpackOutputFile()) {
-        options.push_back("--statpack");
-    }
-    if (args.spanlistLikeOutput()) {
-        options.push_back("-v");
-    }
-    if (args.sampleInterval() != 0) {
-        options.push_back("--sample");
-    }
-    return options;
-}
-
 bool needsRoot(const MWMemweightArgs& args) {
     return args.targetAll() || args.searchForUnmapped();
 }
 
-Formatters createFormatters(const MWMemweightArgs& args) {
+/// Appends the formatter that writes to the file, if one is named; false when the file cannot be written.
+template <class Formatter>
+bool appendFileFormatter(Formatters& formatters, const std::optional<std::string>& path,
+                         const char* failure) {
+    if (!path) {
+        return true;
+    }
+    if (auto formatter = Formatter::initWithPath(*path)) {
+        formatters.push_back(std::move(formatter));
+        return true;
+    }
+    std::fputs(failure, stderr);
+    return false;
+}
+
+/// Text first. None when an output file cannot be written; the user has then been told which.
+std::optional<Formatters> createFormatters(const MWMemweightArgs& args) {
     Formatters formatters;
     formatters.push_back(std::make_unique<MWOutputFormatterText>(MWTextStyle{
         .summaryFormat = args.summaryFormat(), .options = args.textOptions(), .sort = args.textSort()}));
-    return formatters;
+    const bool created = appendFileFormatter<MWOutputFormatterJSON>(formatters, args.JSONOutputFile(),
+                                                                    "Unable to create JSON output\n") &&
+                         appendFileFormatter<MWOutputFormatterStatpack>(formatters, args.statpackOutputFile(),
+                                                                        "Unable to create statpack output\n");
+    return created ? std::optional(std::move(formatters)) : std::nullopt;
 }
 
 /// None when there is nothing to measure; the user has then been told why.
@@ -124,12 +132,6 @@ int MWMemweightMain(int argc, char* const argv[]) {
     if (!args) {
         return rejectArguments(args.error());
     }
-    if (const auto options = optionsNotBuilt(*args); !options.empty()) {
-        for (const char* option : options) {
-            fmt::fprintf(stderr, "memweight: %s is not built yet\n", option);
-        }
-        return kFailure;
-    }
     return MWRunMemweight(*args);
 }
 
@@ -143,14 +145,23 @@ int MWRunMemweight(MWMemweightArgs& args) {
         return kFailure;
     }
     // Before the targets are resolved: an output that cannot be written fails before any process is read.
-    const Formatters formatters = createFormatters(args);
-    const auto targets = resolveTargets(args);
+    const auto formatters = createFormatters(args);
+    if (!formatters) {
+        return removeOutputFiles(args);
+    }
+    auto targets = resolveTargets(args);
     if (!targets) {
         return removeOutputFiles(args);
     }
-    measure(args, *targets, formatters);
-    for (const auto& formatter : formatters) {
+    bool succeeded = true;
+    if (args.sampleInterval() != 0) {
+        targets.reset();  // they do exist: each sample resolves them anew
+        succeeded = MWSampling(args, *formatters).run();
+    } else {
+        measure(args, *targets, *formatters);
+    }
+    for (const auto& formatter : *formatters) {
         formatter->close();
     }
-    return kSuccess;
+    return succeeded ? kSuccess : kFailure;
 }

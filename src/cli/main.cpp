@@ -1,6 +1,8 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <csignal>
+
 #include "cli/MWEntry.h"
 #include "platform/linux/MWLinuxHost.h"
 
@@ -20,6 +22,8 @@ void fillStandardDescriptors() {
 
 int main(int argc, char* argv[]) {
     fillStandardDescriptors();
+    // A reader that has seen enough of the report must not cut the output files off.
+    std::signal(SIGPIPE, SIG_IGN);
     MWLinuxHost host;
     MWHostInterface::setCurrent(&host);
     return MWMemweightMain(argc, argv);

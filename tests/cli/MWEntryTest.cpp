@@ -101,10 +101,6 @@ TEST(MWEntry, RefusesBeforeAnythingIsTouched) {
     host.processes[5] = processOfFourPages("/bin/five");
     host.effectiveUser = 1000;
     const std::vector<std::pair<std::vector<std::string>, std::string>> cases = {
-        {{"nosuch", "-j", "/dev/null", "-v"},
-         "memweight: --json is not built yet\nmemweight: -v is not built yet\n"},
-        {{"--sample", "1", "--statpack", "a.spj", "1"},
-         "memweight: --statpack is not built yet\nmemweight: --sample is not built yet\n"},
         {{"-a"}, "Must run as root.\n"},
         {{"--unmapped", "five"}, "Must run as root.\n"},
     };
@@ -120,19 +116,69 @@ TEST(MWEntry, RefusesBeforeAnythingIsTouched) {
     EXPECT_EQ(run({"--unmapped", "--vmObjectDirty", "five"}).status, 0);
 }
 
-TEST(MWEntry, ARunWithoutTargetsSaysSoAndRemovesItsOutputFiles) {
-    FakeHost host;
-    MWMemweightArgs args;
-    args.setTargetPids({{777, std::nullopt}});
-    args.setJSONOutputFile("a.json");
-    args.setStatpackOutputFile("a.spj");
-    const auto none = capture([&] { return MWRunMemweight(args); });
+/// Where a test's output files go.
+class MWEntryFiles : public testing::Test {
+protected:
+    void SetUp() override {
+        ASSERT_NE(mkdtemp(_directory.data()), nullptr);
+        _host.processes[5] = processOfFourPages("/bin/five");
+    }
+    void TearDown() override { std::filesystem::remove_all(_directory); }
+    std::string path(const std::string& name) const { return _directory + "/" + name; }
+    static std::string contentOf(const std::string& path) {
+        std::ifstream file(path);
+        return {std::istreambuf_iterator<char>(file), {}};
+    }
+
+    FakeHost _host;
+    std::string _directory = testing::TempDir() + "memweight-XXXXXX";
+};
+
+TEST_F(MWEntryFiles, ARunWithoutTargetsSaysSoAndRemovesItsOutputFiles) {
+    const auto none = run({"--pid", "777", "-j", path("a.json"), "--statpack", path("a.spj")});
     EXPECT_EQ(none.status, 1);
     EXPECT_EQ(none.output, "");
     EXPECT_EQ(none.errors,
               "Unable to analyze process with pid 777 (try as root?)\n"
               "Unable to find any processes matching the supplied process names or pids (try as root?)\n");
-    EXPECT_EQ(host.unlinked, (std::vector<std::string>{"a.json", "a.spj"}));
+    EXPECT_EQ(_host.unlinked, (std::vector<std::string>{path("a.json"), path("a.spj")}));
+}
+
+TEST_F(MWEntryFiles, AnOutputThatCannotBeWrittenFailsBeforeAnythingIsRead) {
+    const auto noDocument = run({"five", "-j", "/nonexistent/a.json", "--statpack", path("a.spj")});
+    EXPECT_EQ(noDocument.status, 1);
+    EXPECT_EQ(noDocument.output, "");
+    EXPECT_EQ(noDocument.errors,
+              "Unable to open JSON writer: No such file or directory\nUnable to create JSON output\n");
+    EXPECT_EQ(_host.unlinked, (std::vector<std::string>{"/nonexistent/a.json", path("a.spj")}));
+    const auto noMetrics = run({"five", "-j", path("a.json"), "--statpack", _directory});
+    EXPECT_EQ(noMetrics.status, 1);
+    EXPECT_EQ(noMetrics.errors,
+              "Unable to open spwriter: Is a directory\nUnable to create statpack output\n");
+    EXPECT_EQ(_host.asked("task_read_for_pid"), 0);
+}
+
+TEST_F(MWEntryFiles, OneMeasurementGoesToAllOutputs) {
+    const auto report = run({"five", "-v", "-f", "bytes", "-j", path("a.json"), "--statpack", path("a.spj")});
+    EXPECT_EQ(report.status, 0);
+    EXPECT_EQ(report.errors, "");
+    EXPECT_LT(report.output.find("[objectid]"), report.output.find("16384 B"));
+    const std::string document = contentOf(path("a.json"));
+    EXPECT_NE(document.find(R"("regions":[{)"), std::string::npos);
+    EXPECT_TRUE(document.ends_with(R"("page size":4096})")) << "closed";
+    EXPECT_EQ(document.find("vm_object_dirty_analysis"), std::string::npos)
+        << "the mode is known when the document is opened";
+    EXPECT_NE(contentOf(path("a.spj")).find(R"("metric":"total_memory","unit":"B","value":16384)"),
+              std::string::npos);
+}
+
+TEST_F(MWEntryFiles, AFullDiskIsToldAndTheReportComesOut) {
+    const auto report = run({"five", "-f", "bytes", "-j", "/dev/full", "--statpack", "/dev/full"});
+    EXPECT_EQ(report.status, 0);
+    EXPECT_EQ(
+        report.errors,
+        "memweight: /dev/full: No space left on device\nmemweight: /dev/full: No space left on device\n");
+    EXPECT_NE(report.output.find("16384 B"), std::string::npos);
 }
 
 TEST(MWEntry, OneMeasurementReportsWhatWasFoundAndNamesWhatWasNot) {
