@@ -193,6 +193,23 @@ TEST(SocketMemory, DatagramsAreTheReceivers) {
     EXPECT_GE(liveBytes(receiver.get()), 50U * 1000U);
 }
 
+TEST(SocketMemory, StreamsOfBothAddressFamilies) {
+    for (const int family : {AF_INET, AF_INET6}) {
+        const procfs::Descriptor listener(socket(family, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_storage address = {};
+        socklen_t length = sizeof(address);
+        if (!listener || listen(listener.get(), 1) != 0) {
+            continue;  // a system without IPv6
+        }
+        getsockname(listener.get(), reinterpret_cast<sockaddr*>(&address), &length);
+        const procfs::Descriptor writer(socket(family, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        ASSERT_EQ(connect(writer.get(), reinterpret_cast<sockaddr*>(&address), length), 0);
+        const procfs::Descriptor reader(accept(listener.get(), nullptr, nullptr));
+        const uint64_t written = fill(writer.get());
+        EXPECT_GE(liveBytes(reader.get()) + liveBytes(writer.get()), written) << "where the kernel put them";
+    }
+}
+
 TEST(SocketMemory, AnotherNamespaceIsEntered) {
     if (geteuid() != 0) {
         GTEST_SKIP() << "needs the right to enter namespaces";

@@ -154,7 +154,7 @@ bool readPart(Bytes part, Family family, SocketBytes& bytes) {
             header.nlmsg_type == NLMSG_ERROR) {
             return false;
         }
-        if (header.nlmsg_type == SOCK_DIAG_BY_FAMILY) {
+        if (header.nlmsg_type == SOCK_DIAG_BY_FAMILY || header.nlmsg_type == TCPDIAG_GETSOCK) {
             addSocket(family, part.subspan(sizeof(nlmsghdr), length - sizeof(nlmsghdr)), bytes);
         }
         part = without(part, aligned(length));
@@ -175,10 +175,10 @@ public:
         : _connection(std::move(connection)), _buffer(kLargestPart) {}
 
     SocketBytes read() {
+        _readStreams();
         for (const uint8_t family : {uint8_t{AF_INET}, uint8_t{AF_INET6}}) {
-            _readInternet(Family::tcp, family, IPPROTO_TCP);
-            _readInternet(Family::datagram, family, IPPROTO_UDP);
-            _readInternet(Family::datagram, family, IPPROTO_RAW);
+            _readDatagrams(family, IPPROTO_UDP);
+            _readDatagrams(family, IPPROTO_RAW);
         }
         unix_diag_req local = {};
         local.sdiag_family = AF_UNIX;
@@ -199,23 +199,33 @@ public:
 
 private:
     static constexpr size_t kLargestPart = size_t{64} << 10U;
+    static constexpr uint8_t kMemory = 1U << (INET_DIAG_SKMEMINFO - 1U);
 
-    void _readInternet(Family family, uint8_t addressFamily, uint8_t protocol) {
+    // The older question, which is for all address families at once: the kernel goes through its whole table
+    // of connections for each question, however few there are.
+    void _readStreams() {
+        inet_diag_req request = {};
+        request.idiag_ext = kMemory;
+        request.idiag_states = UINT32_MAX;
+        _read(Family::tcp, request, TCPDIAG_GETSOCK);
+    }
+
+    void _readDatagrams(uint8_t addressFamily, uint8_t protocol) {
         inet_diag_req_v2 request = {};
         request.sdiag_family = addressFamily;
         request.sdiag_protocol = protocol;
-        request.idiag_ext = 1U << (INET_DIAG_SKMEMINFO - 1U);
+        request.idiag_ext = kMemory;
         request.idiag_states = UINT32_MAX;
-        _read(family, request);
+        _read(Family::datagram, request);
     }
 
     template <class Request>
-    void _read(Family family, const Request& request) {
+    void _read(Family family, const Request& request, uint16_t question = SOCK_DIAG_BY_FAMILY) {
         struct {
             nlmsghdr header;
             Request request;
         } message = {.header = {.nlmsg_len = sizeof(message),
-                                .nlmsg_type = SOCK_DIAG_BY_FAMILY,
+                                .nlmsg_type = question,
                                 .nlmsg_flags = NLM_F_REQUEST | NLM_F_DUMP,
                                 .nlmsg_seq = 0,
                                 .nlmsg_pid = 0},
