@@ -125,6 +125,9 @@ std::set<int32_t> MWMemweightArgs::_exclusions() const {
 
 /// Adds what the remaining descriptions name to `targetPids`; the error tells which of them named nothing.
 std::optional<MWError> MWMemweightArgs::_resolveDescriptions() {
+    if (_potentialTargetProcesses.empty()) {
+        return std::nullopt;  // pids alone need no look at all processes, which a sampling run would repeat
+    }
     std::vector<std::string> messages;
     const auto found = MWProcess::pidsForStringDescriptions(listOf(_potentialTargetProcesses), &messages);
     for (const auto& [pid, name] : found.value_or(MWPidMap{})) {

@@ -91,7 +91,8 @@ public:
 
     virtual int proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) = 0;
     virtual int proc_pidinfo(int32_t pid, proc_bsdinfo& record) = 0;
-    /// The number of pids; fills as many as `pids` has room for. An empty span asks for the number alone.
+    /// The number of pids, of which some may have no record; fills as many as `pids` has room for. An empty
+    /// span asks for the number alone.
     virtual int proc_listallpids(std::span<int32_t> pids) = 0;
     /// 0 on success.
     virtual int proc_pid_rusage(int32_t pid, rusage_info_v5& record) = 0;

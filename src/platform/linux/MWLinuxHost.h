@@ -47,7 +47,7 @@ public:
 
     int proc_pidinfo(int32_t pid, proc_bsdshortinfo& record) override;
     int proc_pidinfo(int32_t pid, proc_bsdinfo& record) override;
-    /// Without kernel threads: they are the kernel, which is pid 0.
+    /// With kernel threads, which have no record: they are the kernel, which is pid 0.
     int proc_listallpids(std::span<int32_t> pids) override;
     /// Charge: RssAnon + RssShmem + VmSwap + VmPTE + HugetlbPages of `status`. Peak: the larger of that and
     /// VmHWM, which includes clean file pages.

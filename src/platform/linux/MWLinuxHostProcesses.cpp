@@ -106,14 +106,9 @@ int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
     if (pids.empty()) {
         return static_cast<int>(entries.size() + 1);
     }
-    size_t filled = 0;
-    pids[filled++] = 0;
-    for (const int32_t pid : entries) {
-        const auto stat = _statOfPid(pid);
-        if (stat && !stat->isKernelThread() && filled < pids.size()) {
-            pids[filled++] = pid;
-        }
-    }
+    pids[0] = 0;
+    const size_t filled = 1 + std::min(entries.size(), pids.size() - 1);
+    std::copy_n(entries.begin(), filled - 1, pids.begin() + 1);
     return static_cast<int>(filled);
 }
 
