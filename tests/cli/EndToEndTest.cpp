@@ -1,3 +1,4 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
 #include <sys/prctl.h>
@@ -8,10 +9,15 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <map>
+#include <nlohmann/json.hpp>
 #include <regex>
 #include <sstream>
 #include <string>
+#include <thread>
 #include <utility>
 
 #include "support/ChildProcess.h"
@@ -107,6 +113,54 @@ TEST(EndToEnd, SharedMemoryIsCountedOnceAndNamed) {
     ASSERT_TRUE(report.contains("\n" + others + "\n")) << report.text;
     EXPECT_EQ(report.dirty(others, category), 30 * kPage) << "what one process has touched of it";
     EXPECT_EQ(report.dirty(kSummary, category), 50 * kPage) << "both together, once";
+}
+
+TEST(EndToEnd, WhatAProcessHoldsWithoutMappingItIsInItsCharge) {
+    constexpr uint64_t kHeld = 64 * kPage;
+    const std::string category = "Owned physical memweight (unmapped)";
+    const int memfd = memfd_create("end-to-end", 0);
+    ASSERT_EQ(posix_fallocate(memfd, 0, kHeld), 0);
+    const ChildProcess holder;
+    const ChildProcess mapper([=] { return touchPages(memfd, 0, 30); });
+    close(memfd);
+    const std::string pid = std::to_string(holder.pid());
+    EXPECT_EQ(memweight("--pid " + pid).dirty("", category), kHeld);
+    EXPECT_FALSE(memweight("--vmObjectDirty --pid " + pid).contains(category));
+    if (geteuid() == 0) {
+        const Report report = memweight("--unmapped " + pid);
+        const std::string others = "Shared with cli_tests [" + std::to_string(mapper.pid()) + "]:";
+        ASSERT_TRUE(report.contains("\n" + others + "\n")) << report.text;
+        EXPECT_EQ(report.dirty(others, "shared memory (memfd)"), kHeld);
+    }
+}
+
+/// Goes on taking memory, a little at a time, up to 100 MiB.
+uint64_t grow() {
+    std::thread([] {
+        constexpr size_t kStep = 256 * 1024;
+        for (int step = 0; step < 400; ++step) {
+            std::memset(mmap(nullptr, kStep, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0), 1,
+                        kStep);
+            usleep(10000);
+        }
+    }).detach();
+    return 0;
+}
+
+TEST(EndToEnd, AGrowingProcessIsSampledUntilTheInterrupt) {
+    const ChildProcess child(grow);
+    const std::string path = testing::TempDir() + "memweight-" + std::to_string(getpid()) + ".json";
+    const Report report =
+        memweight("--sample 0.2 --pid " + std::to_string(child.pid()) + " -j " + path, "timeout -s INT 2 ");
+    EXPECT_TRUE(report.contains("Sampling at 0.2s interval... (<ctrl-c> to stop)\n")) << report.text;
+    EXPECT_TRUE(report.contains("\nStopping...\nAnalyzing and writing output...\n")) << report.text;
+    std::ifstream file(path);
+    const auto samples = nlohmann::json::parse(file)["samples"];
+    std::filesystem::remove(path);
+    ASSERT_GE(samples.size(), 2U);
+    for (size_t sample = 1; sample < samples.size(); ++sample) {
+        EXPECT_GT(samples[sample]["total memweight"], samples[sample - 1]["total memweight"]);
+    }
 }
 
 TEST(EndToEnd, OneProcessAloneIsOneTable) {

@@ -6,6 +6,7 @@
 #include <atomic>
 #include <cerrno>
 #include <csignal>
+#include <memory>
 #include <semaphore>
 #include <vector>
 
@@ -13,6 +14,7 @@
 #include "platform/MWInvariant.h"
 #include "platform/MWPhysMemweightSwitch.h"
 #include "platform/MWWorkQueue.h"
+#include "platform/linux/LinuxTimer.h"
 #include "support/FakeHost.h"
 
 namespace {
@@ -23,6 +25,66 @@ TEST(WorkQueue, RunsEachItemOnceAndWaitsForAll) {
     queue.apply(runs.size(), [&](size_t index) { ++runs[index]; });
     EXPECT_TRUE(std::all_of(runs.begin(), runs.end(), [](int count) { return count == 1; }));
     queue.apply(0, [](size_t) { FAIL() << "there is no work"; });
+}
+
+TEST(SerialQueue, RunsItemsInOrderAndAllOfThem) {
+    std::vector<int> order;
+    std::binary_semaphore goOn(0);
+    {
+        MWSerialQueue queue("test.serial", QOS_CLASS_UTILITY);
+        queue.async([&] { goOn.acquire(); });
+        for (int item = 0; item < 100; ++item) {
+            queue.async([&order, item] { order.push_back(item); });
+        }
+        EXPECT_GE(queue.waiting(), 100U);
+        goOn.release();
+        queue.sync([&] { EXPECT_EQ(order.size(), 100U); });
+        queue.async([&order] { order.push_back(100); });
+    }
+    EXPECT_EQ(order.size(), 101U) << "its end waits for what is queued";
+    EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
+}
+
+TEST(SerialQueue, AnItemIsDestroyedBeforeTheNextOneIsWaitedFor) {
+    MWSerialQueue queue("test.serial", QOS_CLASS_UTILITY);
+    const auto held = std::make_shared<int>(1);
+    queue.async([held] {});
+    queue.sync([] {});
+    EXPECT_EQ(held.use_count(), 1);
+}
+
+TEST(LinuxTimer, CountsTheFiresThatComeWhileTheHandlerRuns) {
+    constexpr uint64_t kMillisecond = 1'000'000;
+    constexpr uint64_t kFires = 20;
+    uint64_t total = 0;
+    int calls = 0;
+    std::binary_semaphore goOn(0);
+    std::binary_semaphore allCame(0);
+    MWSerialQueue queue("test.timer", QOS_CLASS_USER_INITIATED);
+    const auto timer = LinuxTimer::create(queue, [&](uint64_t fires) {
+        if (++calls == 1) {
+            goOn.acquire();
+        }
+        const bool wereMissing = total < kFires;
+        total += fires;
+        if (wereMissing && total >= kFires) {
+            allCame.release();
+        }
+    });
+    ASSERT_NE(timer, nullptr);
+    timer->arm({.firstAfter = 0, .interval = kMillisecond, .leeway = 0});
+    // A second timer tells when the first one has fired so often.
+    std::binary_semaphore enough(0);
+    MWSerialQueue otherQueue("test.other", QOS_CLASS_USER_INITIATED);
+    const auto other = LinuxTimer::create(otherQueue, [&](uint64_t) { enough.release(); });
+    other->arm({.firstAfter = kFires * kMillisecond, .interval = 1000 * kMillisecond, .leeway = 0});
+    enough.acquire();
+    goOn.release();
+    allCame.acquire();
+    timer->cancel();
+    queue.sync([&] { EXPECT_LT(calls, 10); });
+    const int callsAtTheEnd = calls;
+    queue.sync([&] { EXPECT_EQ(calls, callsAtTheEnd); });
 }
 
 TEST(InterruptSource, DeliversEachInterruptUntilItIsCancelled) {
