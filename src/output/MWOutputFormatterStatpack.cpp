@@ -107,8 +107,8 @@ void MWOutputFormatterStatpack::printGlobalAuxData(const MWAuxDataTree& auxData)
 void MWOutputFormatterStatpack::endAtTime(const MWTime& time) {
     constexpr uint64_t kPerMillisecond = 1'000'000;
     const uint64_t elapsed = time.machContinuousTimeNsec() - _startTime->machContinuousTimeNsec();
-    spwriter_new_value(*_writer, "gather_duration", spunit_ms,
-                       static_cast<double>(elapsed / kPerMillisecond));
+    const uint64_t milliseconds = elapsed / kPerMillisecond;
+    spwriter_new_value(*_writer, "gather_duration", spunit_ms, static_cast<double>(milliseconds));
     spwriter_record_tag(*_writer, sptag_context);
 }
 

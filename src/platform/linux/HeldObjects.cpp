@@ -79,7 +79,7 @@ private:
         const std::string_view target = _target;
         std::string_view socket = target;
         if (procfs::takePrefix(socket, "socket:[")) {
-            _addSocket(numberInBrackets(socket).value_or(0));
+            _addSocket(numberInBrackets(socket).value_or(0), directory, number);
         } else if (target == "anon_inode:bpf-map") {
             _addBpfMap(number);
         } else if (target.starts_with("/dev/dri/")) {
@@ -93,14 +93,18 @@ private:
         }
     }
 
-    void _addSocket(uint64_t inode) {
-        if (_sockets == nullptr) {
+    void _addSocket(uint64_t inode, int directory, const char* number) {
+        if (!_networkNamespace) {
             _networkNamespace = procfs::readNamespace(_process, "net");
-            _sockets = &_scan.targets.socketsOf(_networkNamespace, _process);
         }
-        if (const auto found = _sockets->find(inode); inode != 0 && found != _sockets->end()) {
-            _add(_scan.identity.unmapped(ObjectIdentity::Unmapped::socket, _networkNamespace, inode),
-                 MWLedgerNetwork, {.virtual_size = found->second, .resident = found->second});
+        const uint64_t bytes = _scan.targets.bytesOf({.inode = inode,
+                                                      .networkNamespace = *_networkNamespace,
+                                                      .processDirectory = _process,
+                                                      .directory = directory,
+                                                      .descriptor = number});
+        if (bytes != 0) {
+            _add(_scan.identity.unmapped(ObjectIdentity::Unmapped::socket, *_networkNamespace, inode),
+                 MWLedgerNetwork, {.virtual_size = bytes, .resident = bytes});
         }
     }
 
@@ -190,8 +194,7 @@ private:
     std::string _target;
     std::string _text;
     const MemoryMounts* _knownMounts = nullptr;
-    const SocketBytes* _sockets = nullptr;
-    uint64_t _networkNamespace = 0;
+    std::optional<uint64_t> _networkNamespace;
 };
 
 }  // namespace
@@ -210,13 +213,13 @@ const MemoryMounts& DescriptorTargets::mountsOf(int processDirectory) {
     return *mounts;
 }
 
-const SocketBytes& DescriptorTargets::socketsOf(uint64_t networkNamespace, int processDirectory) {
+uint64_t DescriptorTargets::bytesOf(const Socket& socket) {
     const std::lock_guard lock(_mutex);
-    auto& sockets = _sockets[networkNamespace];
+    auto& sockets = _sockets[socket.networkNamespace];
     if (sockets == nullptr) {
-        sockets = std::make_unique<const SocketBytes>(socketBytes(processDirectory));
+        sockets = std::make_unique<SocketMemory>(socket.processDirectory);
     }
-    return *sockets;
+    return sockets->bytesOf(socket.inode, socket.directory, socket.descriptor);
 }
 
 DescriptorTargets::FileSystem DescriptorTargets::fileSystemOf(uint64_t device, int directory,

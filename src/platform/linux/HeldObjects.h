@@ -37,8 +37,15 @@ public:
 
     /// Of the mount namespace of the process with this directory, seen from its root.
     const MemoryMounts& mountsOf(int processDirectory);
-    /// Of the network namespace with this number, in which the process is.
-    const SocketBytes& socketsOf(uint64_t networkNamespace, int processDirectory);
+    struct Socket {
+        uint64_t inode;
+        uint64_t networkNamespace;  ///< in which the process is
+        int processDirectory;
+        int directory;           ///< the process's "fd"
+        const char* descriptor;  ///< the socket's entry there
+    };
+    /// What the socket holds in the kernel.
+    uint64_t bytesOf(const Socket& socket);
     /// The file system with this device number; `path` leads to a file on it and is not opened for more than
     /// the question.
     FileSystem fileSystemOf(uint64_t device, int directory, const char* path);
@@ -46,7 +53,7 @@ public:
 private:
     std::mutex _mutex;
     std::map<std::pair<uint64_t, std::string>, std::unique_ptr<const MemoryMounts>> _mounts;
-    std::map<uint64_t, std::unique_ptr<const SocketBytes>> _sockets;
+    std::map<uint64_t, std::unique_ptr<SocketMemory>> _sockets;  ///< by network namespace
     std::map<uint64_t, FileSystem> _fileSystems;
 };
 

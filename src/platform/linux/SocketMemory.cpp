@@ -11,16 +11,18 @@
 #include <sched.h>
 #include <sys/socket.h>
 #include <sys/time.h>
+#include <sys/xattr.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <iterator>
+#include <string>
+#include <string_view>
 #include <system_error>
 #include <thread>
 #include <vector>
-
-#include "platform/linux/Procfs.h"
 
 namespace sockdiag {
 
@@ -138,9 +140,8 @@ Socket readSocket(Family family, Bytes bytes) {
 // Connections that nobody has accepted yet and sockets that nobody holds any more have no inode.
 void addSocket(Family family, Bytes message, SocketBytes& bytes) {
     const Socket socket = readSocket(family, message);
-    const uint64_t held = readAttributes(family, socket.attributes).bytes(family);
-    if (socket.inode != 0 && held != 0) {
-        bytes[socket.inode] = held;
+    if (socket.inode != 0) {
+        bytes[socket.inode] = readAttributes(family, socket.attributes).bytes(family);
     }
 }
 
@@ -168,33 +169,25 @@ namespace {
 
 using sockdiag::Family;
 
-/// One connection to the kernel's lists of sockets.
-class SocketLists {
+/// Asks a connection to the kernel's lists for one of them.
+class SocketList {
 public:
-    explicit SocketLists(procfs::Descriptor connection)
-        : _connection(std::move(connection)), _buffer(kLargestPart) {}
+    SocketList(int connection, SocketBytes& bytes)
+        : _connection(connection), _bytes(bytes), _buffer(kLargestPart) {}
 
-    SocketBytes read() {
-        _readStreams();
-        for (const uint8_t family : {uint8_t{AF_INET}, uint8_t{AF_INET6}}) {
-            _readDatagrams(family, IPPROTO_UDP);
-            _readDatagrams(family, IPPROTO_RAW);
+    void read(Family family) {
+        switch (family) {
+            case Family::tcp:
+                return _readStreams();
+            case Family::datagram:
+                return _readDatagrams();
+            case Family::local:
+                return _readLocal();
+            case Family::netlink:
+                return _readNetlink();
+            case Family::packet:
+                return _readPacket();
         }
-        unix_diag_req local = {};
-        local.sdiag_family = AF_UNIX;
-        local.udiag_states = UINT32_MAX;
-        local.udiag_show = UDIAG_SHOW_MEMINFO | UDIAG_SHOW_RQLEN | UDIAG_SHOW_PEER;
-        _read(Family::local, local);
-        netlink_diag_req netlink = {};
-        netlink.sdiag_family = AF_NETLINK;
-        netlink.sdiag_protocol = NDIAG_PROTO_ALL;
-        netlink.ndiag_show = NDIAG_SHOW_MEMINFO;
-        _read(Family::netlink, netlink);
-        packet_diag_req packet = {};
-        packet.sdiag_family = AF_PACKET;
-        packet.pdiag_show = PACKET_SHOW_MEMINFO | PACKET_SHOW_RING_CFG;
-        _read(Family::packet, packet);
-        return std::move(_bytes);
     }
 
 private:
@@ -210,13 +203,40 @@ private:
         _read(Family::tcp, request, TCPDIAG_GETSOCK);
     }
 
-    void _readDatagrams(uint8_t addressFamily, uint8_t protocol) {
+    void _readDatagrams() {
         inet_diag_req_v2 request = {};
-        request.sdiag_family = addressFamily;
-        request.sdiag_protocol = protocol;
         request.idiag_ext = kMemory;
         request.idiag_states = UINT32_MAX;
-        _read(Family::datagram, request);
+        for (const uint8_t addressFamily : {uint8_t{AF_INET}, uint8_t{AF_INET6}}) {
+            for (const uint8_t protocol : {uint8_t{IPPROTO_UDP}, uint8_t{IPPROTO_RAW}}) {
+                request.sdiag_family = addressFamily;
+                request.sdiag_protocol = protocol;
+                _read(Family::datagram, request);
+            }
+        }
+    }
+
+    void _readLocal() {
+        unix_diag_req request = {};
+        request.sdiag_family = AF_UNIX;
+        request.udiag_states = UINT32_MAX;
+        request.udiag_show = UDIAG_SHOW_MEMINFO | UDIAG_SHOW_RQLEN | UDIAG_SHOW_PEER;
+        _read(Family::local, request);
+    }
+
+    void _readNetlink() {
+        netlink_diag_req request = {};
+        request.sdiag_family = AF_NETLINK;
+        request.sdiag_protocol = NDIAG_PROTO_ALL;
+        request.ndiag_show = NDIAG_SHOW_MEMINFO;
+        _read(Family::netlink, request);
+    }
+
+    void _readPacket() {
+        packet_diag_req request = {};
+        request.sdiag_family = AF_PACKET;
+        request.pdiag_show = PACKET_SHOW_MEMINFO | PACKET_SHOW_RING_CFG;
+        _read(Family::packet, request);
     }
 
     template <class Request>
@@ -230,7 +250,7 @@ private:
                                 .nlmsg_seq = 0,
                                 .nlmsg_pid = 0},
                      .request = request};
-        if (send(_connection.get(), &message, sizeof(message), 0) < 0) {
+        if (send(_connection, &message, sizeof(message), 0) < 0) {
             return;
         }
         while (_readPart(family)) {
@@ -240,16 +260,38 @@ private:
     bool _readPart(Family family) {
         ssize_t count = 0;
         do {
-            count = recv(_connection.get(), _buffer.data(), _buffer.size(), 0);
+            count = recv(_connection, _buffer.data(), _buffer.size(), 0);
         } while (count < 0 && errno == EINTR);
         return count > 0 &&
                sockdiag::readPart(std::span(_buffer).first(static_cast<size_t>(count)), family, _bytes);
     }
 
-    procfs::Descriptor _connection;
+    int _connection;
+    SocketBytes& _bytes;
     std::vector<std::byte> _buffer;
-    SocketBytes _bytes;
 };
+
+/// In which lists a socket can stand, by the name of its protocol; all where the kernel does not tell it.
+std::vector<Family> familiesOf(int directory, const char* descriptor) {
+    std::array<char, 64> buffer = {};
+    const std::string path = "/proc/self/fd/" + std::to_string(directory) + "/" + descriptor;
+    const ssize_t length = getxattr(path.c_str(), "system.sockprotoname", buffer.data(), buffer.size() - 1);
+    if (length < 0) {
+        return {sockdiag::kFamilies.begin(), sockdiag::kFamilies.end()};
+    }
+    struct Protocol {
+        std::string_view name;
+        Family family;
+    };
+    constexpr Protocol kProtocols[] = {{"TCP", Family::tcp},       {"UNIX", Family::local},
+                                       {"UDP", Family::datagram},  {"RAW", Family::datagram},
+                                       {"PING", Family::datagram}, {"NETLINK", Family::netlink},
+                                       {"PACKET", Family::packet}};
+    const std::string_view name = buffer.data();
+    const auto* protocol = std::ranges::find_if(
+        kProtocols, [=](const Protocol& candidate) { return name.starts_with(candidate.name); });
+    return protocol == std::end(kProtocols) ? std::vector<Family>() : std::vector{protocol->family};
+}
 
 // The kernel answers at once; the time limit is for one that does not.
 procfs::Descriptor connectHere() {
@@ -286,7 +328,20 @@ procfs::Descriptor connectToNamespaceOf(int processDirectory) {
 
 }  // namespace
 
-SocketBytes socketBytes(int processDirectory) {
-    procfs::Descriptor connection = connectToNamespaceOf(processDirectory);
-    return connection ? SocketLists(std::move(connection)).read() : SocketBytes();
+SocketMemory::SocketMemory(int processDirectory) : _connection(connectToNamespaceOf(processDirectory)) {}
+
+void SocketMemory::_list(Family family) {
+    if (_listed.insert(family).second && _connection) {
+        SocketList(_connection.get(), _bytes).read(family);
+    }
+}
+
+uint64_t SocketMemory::bytesOf(uint64_t inode, int directory, const char* descriptor) {
+    if (_listed.size() < sockdiag::kFamilies.size() && !_bytes.contains(inode)) {
+        for (const Family family : familiesOf(directory, descriptor)) {
+            _list(family);
+        }
+    }
+    const auto found = _bytes.find(inode);
+    return found == _bytes.end() ? 0 : found->second;
 }

@@ -1,22 +1,23 @@
 #pragma once
 
+#include <array>
 #include <cstddef>
 #include <cstdint>
+#include <set>
 #include <span>
 #include <unordered_map>
 
-/// Bytes that sockets hold in the kernel, by the socket's inode; sockets that hold none are left out.
-using SocketBytes = std::unordered_map<uint64_t, uint64_t>;
+#include "platform/linux/Procfs.h"
 
-/// One look at all sockets of the network namespace of the process with this directory. Needs no privilege in
-/// the caller's own namespace; another one has to be entered, which a thread made for it does. Empty where
-/// that is refused or the kernel has no such interface; families that it does not serve are left out.
-SocketBytes socketBytes(int processDirectory);
+/// Bytes that sockets hold in the kernel, by the socket's inode.
+using SocketBytes = std::unordered_map<uint64_t, uint64_t>;
 
 namespace sockdiag {
 
 /// The families that the kernel lists, each in messages of its own.
 enum class Family : uint8_t { tcp, datagram, local, netlink, packet };
+inline constexpr std::array kFamilies = {Family::tcp, Family::datagram, Family::local, Family::netlink,
+                                         Family::packet};
 
 /// Adds what one part of a family's list tells; false when it was the last one. Parts that are cut are read
 /// for what they hold.
@@ -27,3 +28,23 @@ enum class Family : uint8_t { tcp, datagram, local, netlink, packet };
 bool readPart(std::span<const std::byte> part, Family family, SocketBytes& bytes);
 
 }  // namespace sockdiag
+
+/// The sockets of one network namespace, each family listed once, when the first socket of it is asked about:
+/// the list of TCP sockets alone takes milliseconds. Needs no privilege in the caller's own namespace;
+/// another one has to be entered, which a thread made for it does.
+class SocketMemory {
+public:
+    /// Of the namespace of the process with this directory. Where it cannot be entered, or where the kernel
+    /// has no such lists, sockets hold nothing.
+    explicit SocketMemory(int processDirectory);
+
+    /// `descriptor` is the entry that leads to the socket in `directory`, a process's "fd".
+    uint64_t bytesOf(uint64_t inode, int directory, const char* descriptor);
+
+private:
+    void _list(sockdiag::Family family);
+
+    procfs::Descriptor _connection;
+    std::set<sockdiag::Family> _listed;
+    SocketBytes _bytes;
+};
