@@ -114,9 +114,9 @@ void spwriter_new_value(spwriter& writer, std::string_view metric, spunit unit, 
         return;
     }
     std::string& line = writer.value.beginning;
-    fmt::format_to(std::back_inserter(line), "{{\"group\":{},\"metric\":", writer.group);
+    fmt::format_to(std::back_inserter(line), R"({{"group":{},"metric":)", writer.group);
     MWAppendJSONString(line, metric);
-    fmt::format_to(std::back_inserter(line), ",\"unit\":\"{}\",\"value\":{}", unit == spunit_B ? "B" : "ms",
+    fmt::format_to(std::back_inserter(line), R"(,"unit":"{}","value":{})", unit == spunit_B ? "B" : "ms",
                    numberText(value));
 }
 

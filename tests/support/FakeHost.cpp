@@ -343,11 +343,13 @@ int FakeHost::sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size
 
 FakeTimer::FakeTimer(FakeHost& host, MWSerialQueue& queue, std::function<void(uint64_t)> handler)
     : _host(host), _queue(queue), _handler(std::move(handler)) {
-    _host.timer = this;
+    _host._timer = this;
 }
 
+// A timer does not go away under a thread that fires it.
 FakeTimer::~FakeTimer() {
-    _host.timer = nullptr;
+    const std::lock_guard lock(_host._timerMutex);
+    _host._timer = nullptr;
 }
 
 void FakeTimer::arm(const MWTimerSchedule& schedule) {
@@ -362,6 +364,11 @@ bool FakeTimer::fire(uint64_t fires) {
         _queue.sync([&] { _handler(fires); });
     }
     return !_isCancelled;
+}
+
+bool FakeHost::fireTimer(uint64_t fires) {
+    const std::lock_guard lock(_timerMutex);
+    return _timer != nullptr && _timer->fire(fires);
 }
 
 std::unique_ptr<MWTimer> FakeHost::makeTimer(MWSerialQueue& queue, std::function<void(uint64_t)> handler) {

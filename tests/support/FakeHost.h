@@ -71,8 +71,7 @@ public:
 
     void arm(const MWTimerSchedule& schedule) override;
     void cancel() override { _isCancelled = true; }
-    /// Returns when the handler has run; false when the timer is cancelled.
-    bool fire(uint64_t fires = 1);
+    bool fire(uint64_t fires);
 
 private:
     FakeHost& _host;
@@ -100,7 +99,6 @@ public:
     bool clockFails = false;
     std::atomic<uint64_t> uptime = 1000;  ///< nanoseconds
     bool noTimers = false;
-    FakeTimer* timer = nullptr;              ///< while there is one
     std::vector<MWTimerSchedule> schedules;  ///< of each arming
     std::binary_semaphore timerArmed = std::binary_semaphore(0);
     int32_t ownPid = 99999;
@@ -120,6 +118,8 @@ public:
     std::vector<std::string> machErrors;  ///< "LABEL: CODE" of each mach_error
     std::vector<std::pair<uint64_t, uint64_t>> pageQueries;  ///< (start, pages) of each page-range query
     std::set<task_t> openTasks;
+    /// Returns when the timer's handler has run; false when there is no timer or it is cancelled.
+    bool fireTimer(uint64_t fires = 1);
     /// How often the operation of this name was asked.
     int asked(const std::string& operation) const;
 
@@ -182,4 +182,8 @@ private:
     mutable std::mutex _mutex;  ///< guards what is remembered; gathering asks from several threads
     std::map<std::string, int> _asked;
     std::map<task_t, size_t> _delivered;
+
+    friend class FakeTimer;
+    std::mutex _timerMutex;
+    FakeTimer* _timer = nullptr;  ///< while there is one
 };

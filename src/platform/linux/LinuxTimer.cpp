@@ -42,7 +42,7 @@ LinuxTimer::LinuxTimer(MWSerialQueue& queue, Handler handler)
 }
 
 LinuxTimer::~LinuxTimer() {
-    cancel();
+    _firing->isCancelled = true;
     if (_thread.joinable()) {
         eventfd_write(_ended.get(), 1);
         _thread.join();
