@@ -22,7 +22,6 @@ enum MWMemweightErrorCode : int {
     MWErrorUnreadableFile = 7,
     MWErrorNoTarget = 8,
     MWErrorSample = 9,
-    MWErrorKernel = 10,
 };
 
 /// What target resolution found. No map when it failed; a map with an error beside it when some names

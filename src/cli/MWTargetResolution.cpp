@@ -67,10 +67,6 @@ MWTargetResolution MWMemweightArgs::targetProcesses() {
         // An excluded process stays excluded when it descends from a target, the tool itself above all.
         _excludeTargets(exclusions);
     }
-    if (_targetPids.contains(kKernelPid)) {
-        return {.targets = {},
-                .error = resolutionError(MWErrorKernel, "Measuring the kernel (pid 0) is not built yet")};
-    }
 
     std::optional<MWTargetMap> targets = MWTargetMap{};
     if (_searchForUnmapped) {

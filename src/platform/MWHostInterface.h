@@ -36,6 +36,33 @@ public:
     virtual void forEachSegment(const std::function<void(const MWImageSegmentDescription&)>& block) const = 0;
 };
 
+/// Names for addresses of the running kernel, from its symbol tables alone. Lives for one gathering.
+class KernelSymbolicator {
+public:
+    struct SourceLocation {
+        std::string path;
+        int line = 0;
+    };
+
+    virtual ~KernelSymbolicator() = default;
+    /// The symbol that contains the address, if one does.
+    virtual std::optional<std::string> nameForAddress(uint64_t address) = 0;
+    virtual std::optional<SourceLocation> sourceLocationForAddress(uint64_t address) = 0;
+};
+
+/// A piece of code that was loaded into the running kernel.
+struct MWKernelExtension {
+    uint64_t OSBundleLoadTag = 0;
+    std::string bundleIdentifier;
+};
+
+/// The answer to mach_memory_info. The arrays are the caller's, who gives each back with vm_deallocate.
+struct MWKernelMemoryArrays {
+    std::span<const mach_zone_name_t> zoneNames;
+    std::span<const mach_zone_info_t> zones;
+    std::span<const mach_memory_info_t> records;
+};
+
 /// Everything that the program asks of the system, clocks included. The live answer is MWLinuxHost; tests
 /// answer from regions and processes that they write down.
 ///
@@ -126,6 +153,15 @@ public:
     /// "vm.self_region_memweight": the tool's own switch, 0 or 1.
     virtual int sysctlSelfRegionMemweight(int32_t& value) = 0;
     virtual int setSysctlSelfRegionMemweight(int32_t value) = 0;
+
+    // The kernel's own memory.
+
+    virtual kern_return_t mach_memory_info(MWKernelMemoryArrays& arrays) = 0;
+    /// Gives an array of `size` bytes back that the host allocated for the caller.
+    virtual kern_return_t vm_deallocate(const void* address, size_t size) = 0;
+    virtual std::vector<MWKernelExtension> loadedKernelExtensions() = 0;
+    /// To be used by one thread. Never none.
+    virtual std::unique_ptr<KernelSymbolicator> makeKernelSymbolicator() = 0;
 
     virtual uint64_t vm_kernel_page_size() = 0;
     virtual std::string mach_error_string(kern_return_t code) = 0;

@@ -202,3 +202,54 @@ struct mach_timebase_info_t {
     uint32_t numer = 1;
     uint32_t denom = 1;
 };
+
+// What mach_memory_info tells of the kernel's own memory.
+
+struct mach_zone_name_t {
+    std::array<char, 80> mzn_name;  ///< not necessarily NUL-terminated
+};
+static_assert(sizeof(mach_zone_name_t) == 80);
+
+/// A zone of the kernel's allocator: elements of one size in memory set aside for them.
+struct mach_zone_info_t {
+    uint64_t mzi_count = 0;     ///< elements in use
+    uint64_t mzi_cur_size = 0;  ///< bytes that the zone holds now
+    uint64_t mzi_max_size = 0;
+    uint64_t mzi_elem_size = 0;   ///< bytes of an element
+    uint64_t mzi_alloc_size = 0;  ///< bytes by which the zone grows
+    uint64_t mzi_sum_size = 0;
+    uint64_t mzi_exhaustible = 0;
+    uint64_t mzi_collectable = 0;  ///< not 0: memory of free elements can be taken back
+};
+static_assert(sizeof(mach_zone_info_t) == 64);
+
+/// Memory by who allocated it, or a figure of the kernel's.
+struct mach_memory_info_t {
+    uint64_t flags;  ///< the MWSite... values, the type in the low byte
+    uint64_t site;   ///< a tag's number, an extension's load tag, a code address or a counter's number
+    uint64_t size;
+    uint64_t free;
+    uint64_t largest;
+    uint64_t collectable_bytes;
+    uint64_t mapped;  ///< a counter's value
+    uint64_t peak;
+    uint16_t tag;
+    uint16_t zone;  ///< index of the zone's name
+    uint32_t reserved1;
+    std::array<uint64_t, 3> reserved2;
+    std::array<char, 80> name;  ///< UTF-8, not necessarily NUL-terminated
+};
+static_assert(sizeof(mach_memory_info_t) == 176);
+
+/// What `site` of a memory-information record is.
+enum MWSiteType : uint8_t {
+    MWSiteTag = 0,
+    MWSiteExtension = 1,
+    MWSiteKernel = 2,
+    MWSiteCounter = 3,
+};
+inline constexpr uint64_t MWSiteTypeMask = 0xFF;
+inline constexpr uint64_t MWSiteWired = 0x100;
+inline constexpr uint64_t MWSiteHidden = 0x200;
+inline constexpr uint64_t MWSiteNamed = 0x400;
+inline constexpr uint64_t MWSiteZone = 0x800;

@@ -10,6 +10,7 @@
 #include <unordered_set>
 
 #include "platform/MWHostInterface.h"
+#include "process/MWKernelProcess.h"
 #include "process/MWProcess.h"
 #include "process/MWUserProcess.h"
 
@@ -191,8 +192,7 @@ std::shared_ptr<MWProcess> MWProcess::processWithPid(int32_t pid) {
 
 std::shared_ptr<MWProcess> MWProcess::processWithBsdInfo(const proc_bsdinfo& info) {
     if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
-        // Measuring the kernel is not built yet; as the only target it is refused with a message.
-        return nullptr;
+        return MWKernelProcess::initWithBsdInfo(info);
     }
     return MWUserProcess::initWithBsdInfo(info);
 }

@@ -134,6 +134,19 @@ TEST(EndToEnd, WhatAProcessHoldsWithoutMappingItIsInItsCharge) {
     }
 }
 
+TEST(EndToEnd, TheKernelIsAProcessForWhoeverLooks) {
+    for (const char* prefix : {"", "setpriv --reuid 65534 --clear-groups "}) {
+        if (*prefix != '\0' && geteuid() != 0) {
+            continue;
+        }
+        const Report report = memweight("kernel", prefix);
+        EXPECT_EQ(report.status, 0) << report.text;
+        EXPECT_TRUE(report.contains("\nkernel [0]: 64-bit\t")) << report.text;
+        EXPECT_TRUE(report.contains("\tMaps:\n")) << report.text;
+        EXPECT_GT(report.dirty("", "VM_KERN_MEMORY_STACK"), 16 * 1024U);
+    }
+}
+
 /// Goes on taking memory, a little at a time, up to 100 MiB.
 uint64_t grow() {
     std::thread([] {

@@ -98,10 +98,11 @@ TEST(MWTargetResolution, TakesWhatIsNamedButForTheExcluded) {
          .pids = Pids{10, 11, 20, 22},
          .standardError = "Unable to analyze process with pid 13 (try as root?)\n",
          .refused = {13}},
-        {.arguments = {"-a", "nosuch", "-x", "worker"}, .pids = Pids{1, 13, 20, 22}, .refused = {10}},
+        {.arguments = {"-a", "nosuch", "-x", "worker"}, .pids = Pids{0, 1, 13, 20, 22}, .refused = {10}},
         // One process only for a name that is also a file's.
         {.arguments = {"worker", "shell"}, .pids = Pids{11, 20}, .files = {"worker"}},
         {{"0", "shell", "-x", "kernel"}, Pids{20}},
+        {{"kernel", "shell"}, Pids{0, 20}},
     });
 }
 
@@ -126,7 +127,6 @@ TEST(MWTargetResolution, TellsWhatItCannotTake) {
         {.arguments = {"/tmp", "shell"},
          .error = "7: Error opening heapsnap /tmp: reading heapsnap files is not built yet",
          .files = {"/tmp"}},
-        {{"0", "shell"}, {}, "10: Measuring the kernel (pid 0) is not built yet"},
     });
 }
 

@@ -37,6 +37,26 @@ private:
     const FakeImage& _image;
 };
 
+template <class Value>
+std::optional<Value> valueAt(const std::map<uint64_t, Value>& values, uint64_t address) {
+    const auto found = values.find(address);
+    return found == values.end() ? std::nullopt : std::optional(found->second);
+}
+
+class FakeSymbolicator : public KernelSymbolicator {
+public:
+    explicit FakeSymbolicator(const FakeHost& host) : _host(host) {}
+    std::optional<std::string> nameForAddress(uint64_t address) override {
+        return valueAt(_host.kernelSymbols, address);
+    }
+    std::optional<SourceLocation> sourceLocationForAddress(uint64_t address) override {
+        return valueAt(_host.kernelLocations, address);
+    }
+
+private:
+    const FakeHost& _host;
+};
+
 }  // namespace
 
 FakeHost::FakeHost() : _previous(MWHostInterface::setCurrent(this)) {
@@ -339,6 +359,29 @@ int FakeHost::sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size
         length = reply.size();
     }
     return 0;
+}
+
+kern_return_t FakeHost::mach_memory_info(MWKernelMemoryArrays& arrays) {
+    _zoneNames.clear();
+    _zones.clear();
+    for (const auto& [name, zone] : kernelZones) {
+        std::copy_n(name.begin(), std::min<size_t>(name.size(), 80),
+                    _zoneNames.emplace_back().mzn_name.begin());
+        _zones.push_back(zone);
+    }
+    if (kernelMemoryResult == KERN_SUCCESS) {
+        arrays = {.zoneNames = _zoneNames, .zones = _zones, .records = kernelRecords};
+    }
+    return kernelMemoryResult;
+}
+
+kern_return_t FakeHost::vm_deallocate(const void*, size_t size) {
+    deallocated.push_back(size);
+    return deallocationResult;
+}
+
+std::unique_ptr<KernelSymbolicator> FakeHost::makeKernelSymbolicator() {
+    return std::make_unique<FakeSymbolicator>(*this);
 }
 
 FakeTimer::FakeTimer(FakeHost& host, MWSerialQueue& queue, std::function<void(uint64_t)> handler)

@@ -112,7 +112,16 @@ public:
     bool ownedReplyIsCut = false;      ///< it is shorter than its count says
     bool ownedReplyIsEndless = false;  ///< it fills any buffer
 
+    std::vector<std::pair<std::string, mach_zone_info_t>> kernelZones;
+    std::vector<mach_memory_info_t> kernelRecords;
+    std::vector<MWKernelExtension> kernelExtensions;
+    std::map<uint64_t, std::string> kernelSymbols;  ///< by address
+    std::map<uint64_t, KernelSymbolicator::SourceLocation> kernelLocations;
+    kern_return_t kernelMemoryResult = KERN_SUCCESS;
+    kern_return_t deallocationResult = KERN_SUCCESS;
+
     std::vector<std::string> unlinked;
+    std::vector<size_t> deallocated;      ///< bytes, in the order in which they were given back
     std::set<task_t> surveyed;            ///< since the last survey began
     std::vector<size_t> ownedFetches;     ///< room of each fetch of owned objects, in bytes
     std::vector<std::string> machErrors;  ///< "LABEL: CODE" of each mach_error
@@ -152,6 +161,10 @@ public:
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;
+    kern_return_t mach_memory_info(MWKernelMemoryArrays& arrays) override;
+    kern_return_t vm_deallocate(const void* address, size_t size) override;
+    std::vector<MWKernelExtension> loadedKernelExtensions() override { return kernelExtensions; }
+    std::unique_ptr<KernelSymbolicator> makeKernelSymbolicator() override;
     uint64_t vm_kernel_page_size() override { return pageSize; }
     std::string mach_error_string(kern_return_t code) override { return "code " + std::to_string(code); }
     void mach_error(std::string_view label, kern_return_t code) override;
@@ -182,6 +195,8 @@ private:
     mutable std::mutex _mutex;  ///< guards what is remembered; gathering asks from several threads
     std::map<std::string, int> _asked;
     std::map<task_t, size_t> _delivered;
+    std::vector<mach_zone_name_t> _zoneNames;
+    std::vector<mach_zone_info_t> _zones;
 
     friend class FakeTimer;
     std::mutex _timerMutex;

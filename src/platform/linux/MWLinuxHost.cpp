@@ -54,7 +54,8 @@ uint64_t readClock(clockid_t clock) {
 
 }  // namespace
 
-MWLinuxHost::MWLinuxHost(const std::string& procDirectory) : _run(procDirectory) {
+MWLinuxHost::MWLinuxHost(const std::string& procDirectory, const std::string& sysDirectory)
+    : _run(procDirectory), _sys(procfs::open(AT_FDCWD, sysDirectory.c_str(), O_DIRECTORY)) {
     raiseDescriptorLimit();
 }
 

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/MWHostInterface.h"
+#include "platform/linux/KernelSymbols.h"
 #include "platform/linux/LinuxTask.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
@@ -22,8 +23,10 @@
 /// regions takes it, the answer that the end was reached drops it.
 class MWLinuxHost : public MWHostInterface {
 public:
-    /// `procDirectory` is the root of a procfs, or of a tree of recorded files.
-    explicit MWLinuxHost(const std::string& procDirectory = "/proc");
+    /// `procDirectory` is the root of a procfs, or of a tree of recorded files; `sysDirectory` that of a
+    /// sysfs.
+    explicit MWLinuxHost(const std::string& procDirectory = "/proc",
+                         const std::string& sysDirectory = "/sys");
     ~MWLinuxHost() override;
     MWLinuxHost(const MWLinuxHost&) = delete;
     MWLinuxHost& operator=(const MWLinuxHost&) = delete;
@@ -67,6 +70,13 @@ public:
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;
+    /// KERN_FAILURE when nothing can be read, which without privilege `meminfo` still can.
+    kern_return_t mach_memory_info(MWKernelMemoryArrays& arrays) override;
+    /// KERN_INVALID_ARGUMENT for what is no array, whole, from here.
+    kern_return_t vm_deallocate(const void* address, size_t size) override;
+    std::vector<MWKernelExtension> loadedKernelExtensions() override;
+    std::unique_ptr<KernelSymbolicator> makeKernelSymbolicator() override;
+
     uint64_t vm_kernel_page_size() override { return _run.pageSize; }
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(std::string_view label, kern_return_t code) override;
@@ -97,11 +107,25 @@ private:
     bool _readProcessFile(int32_t pid, const char* name, std::string& text);
     std::optional<procfs::ProcStat> _statOfPid(int32_t pid);
 
+    /// A copy that the caller gives back.
+    template <class Record>
+    std::span<const Record> _handOver(const std::vector<Record>& records);
+
     LinuxRun _run;
+    procfs::Descriptor _sys;
     std::atomic<int32_t> _selfRegionMemweight = 0;
 
     std::mutex _tasksMutex;  ///< guards the table; a task itself is one thread's at a time
     std::map<task_t, std::unique_ptr<LinuxTask>> _tasks;
     std::set<std::pair<int32_t, task_t>> _tasksByPid;
     task_t _lastTask = 0;
+
+    struct KernelArray {
+        size_t size;
+        std::shared_ptr<void> memory;
+    };
+    std::mutex _kernelMutex;  ///< guards what follows
+    std::map<const void*, KernelArray> _kernelArrays;
+    /// Of the last answer about the kernel's memory, for the symbolicator that is made next.
+    std::shared_ptr<const KernelSourceLocations> _kernelSourceLocations;
 };
