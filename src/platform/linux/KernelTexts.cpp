@@ -10,14 +10,6 @@ namespace procfs {
 
 namespace {
 
-// Takes the next word off the front of `text`; empty at the end.
-std::string_view takeWord(std::string_view& text) {
-    skipBlanks(text);
-    const std::string_view word = text.substr(0, text.find_first_of(" \t"));
-    text.remove_prefix(word.size());
-    return word;
-}
-
 // Takes the last word off the end of `text`; empty when there is none.
 std::string_view takeLastWord(std::string_view& text) {
     text = text.substr(0, text.find_last_not_of(" \t") + 1);

@@ -9,14 +9,6 @@ namespace procfs {
 
 namespace {
 
-// Takes one blank-separated word and the blank behind it.
-std::string_view takeWord(std::string_view& text) {
-    const size_t end = text.find(' ');
-    const std::string_view word = text.substr(0, end);
-    text.remove_prefix(end == std::string_view::npos ? text.size() : end + 1);
-    return word;
-}
-
 template <class Number>
 bool takeField(std::string_view& text, Number& number) {
     std::string_view word = takeWord(text);

@@ -80,6 +80,14 @@ inline void skipBlanks(std::string_view& text) {
     text.remove_prefix(first == std::string_view::npos ? text.size() : first);
 }
 
+/// Takes the next word off the front of `text`; empty at the end.
+inline std::string_view takeWord(std::string_view& text) {
+    skipBlanks(text);
+    const std::string_view word = text.substr(0, text.find_first_of(" \t"));
+    text.remove_prefix(word.size());
+    return word;
+}
+
 /// Takes the next line, without its line end, off the front of `text`.
 inline std::string_view takeLine(std::string_view& text) {
     const size_t end = text.find('\n');

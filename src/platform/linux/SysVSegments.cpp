@@ -9,13 +9,6 @@ namespace procfs {
 
 namespace {
 
-std::string_view takeWord(std::string_view& line) {
-    skipBlanks(line);
-    const std::string_view word = line.substr(0, line.find_first_of(" \t"));
-    line.remove_prefix(word.size());
-    return word;
-}
-
 std::vector<std::string_view> wordsOf(std::string_view line) {
     std::vector<std::string_view> words;
     for (std::string_view word = takeWord(line); !word.empty(); word = takeWord(line)) {
