@@ -70,7 +70,7 @@ _build_release() {
     # A source that is changed while the build runs is newer than the moment when it began.
     touch "$stamp.new" &&
         _configure_release &&
-        cmake --build --preset release --target memweight &&
+        cmake --build --preset release --target memweight memweight-heapsnap &&
         mv "$stamp.new" "$stamp"
 }
 
@@ -80,7 +80,7 @@ build_release() {
 
 # Whether build/release/memweight is there and newer than everything that it is made of.
 is_built() {
-    [[ -x $release/memweight && -f $stamp ]] || return 1
+    [[ -x $release/memweight && -x $release/memweight-heapsnap && -f $stamp ]] || return 1
     [[ -z $(find "$top/src" "$top/CMakeLists.txt" "$top/CMakePresets.json" "$top/dependencies.txt" \
         -newer "$stamp" -print -quit) ]]
 }

@@ -19,6 +19,7 @@ enum MWMemweightErrorCode : int {
     /// A `--pid` argument without digits; also descriptions that matched no process.
     MWErrorProcess = 4,
     MWErrorOption = 5,
+    MWErrorMode = 6,
     MWErrorUnreadableFile = 7,
     MWErrorNoTarget = 8,
     MWErrorSample = 9,
@@ -110,8 +111,10 @@ private:
     Outcome _applySample(const std::string& argument);
     void _crossCheckUnmapped();
 
-    Outcome _resolveFiles();
-    Outcome _resolveFile(const std::string& path);
+    Outcome _resolveFiles(MWTargetMap& heapsnaps);
+    Outcome _resolveFile(const std::string& path, MWTargetMap& heapsnaps);
+    std::optional<int32_t> _pidMetTwice(const MWTargetMap& heapsnaps) const;
+    Outcome _adoptModeOf(const MWProcess& heapsnap, const std::string& path);
     std::set<int32_t> _exclusions() const;
     std::optional<MWError> _resolveDescriptions();
     void _addDescendants();

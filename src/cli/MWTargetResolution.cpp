@@ -4,12 +4,14 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <functional>
 #include <memory>
 #include <vector>
 
 #include "cli/MWMemweightArgs.h"
 #include "platform/MWHostInterface.h"
 #include "platform/MWTerminalText.h"
+#include "process/MWHeapsnapProcess.h"
 
 namespace {
 
@@ -32,8 +34,18 @@ std::vector<int32_t> pidsOf(const MWPidMap& map) {
     return pids;
 }
 
-tl::expected<std::shared_ptr<MWProcess>, std::string> openHeapsnap(const std::string&) {
-    return tl::make_unexpected("reading heapsnap files is not built yet");
+/// Below all pids.
+int64_t keyOfHeapsnap(const std::string& path) {
+    return -1 - static_cast<int64_t>(std::hash<std::string>()(path) >> 1U);
+}
+
+/// All figures of one process are found by its pid: of two, be it two heapsnaps of one process or one from
+/// another machine, neither would be right.
+MWError secondProcessOfPid(int32_t pid) {
+    return resolutionError(MWErrorUnreadableFile,
+                           fmt::format("There is more than one target with pid {}: measure heapsnaps of the "
+                                       "same pid one at a time",
+                                       pid));
 }
 
 void reportUnreadable(int32_t pid, const std::optional<std::string>& name) {
@@ -48,10 +60,11 @@ void reportUnreadable(int32_t pid, const std::optional<std::string>& name) {
 }  // namespace
 
 MWTargetResolution MWMemweightArgs::targetProcesses() {
-    if (auto files = _resolveFiles(); !files) {
+    MWTargetMap heapsnaps;
+    if (auto files = _resolveFiles(heapsnaps); !files) {
         return {.targets = {}, .error = files.error()};
     }
-    if (_targetPids.empty() && _potentialTargetProcesses.empty() && !_targetAll) {
+    if (_targetPids.empty() && _potentialTargetProcesses.empty() && heapsnaps.empty() && !_targetAll) {
         return {.targets = {},
                 .error = resolutionError(MWErrorNoTarget, "Must specify at least one process or heapsnap")};
     }
@@ -68,7 +81,10 @@ MWTargetResolution MWMemweightArgs::targetProcesses() {
         _excludeTargets(exclusions);
     }
 
-    std::optional<MWTargetMap> targets = MWTargetMap{};
+    if (const auto pid = _pidMetTwice(heapsnaps)) {
+        return {.targets = {}, .error = secondProcessOfPid(*pid)};
+    }
+    std::optional<MWTargetMap> targets = std::move(heapsnaps);
     if (_searchForUnmapped) {
         targets = _hiddenProcesses(exclusions);
     }
@@ -78,13 +94,13 @@ MWTargetResolution MWMemweightArgs::targetProcesses() {
     return {.targets = _withoutSkipped(std::move(targets)), .error = std::move(unmatched)};
 }
 
-/// Takes the descriptions that name a file out of `potentialTargetProcesses`.
-MWMemweightArgs::Outcome MWMemweightArgs::_resolveFiles() {
+/// Opens the heapsnaps and takes the descriptions that name a file out of `potentialTargetProcesses`.
+MWMemweightArgs::Outcome MWMemweightArgs::_resolveFiles(MWTargetMap& heapsnaps) {
     for (const auto& path : listOf(_potentialTargetProcesses)) {
         if (!MWHostInterface::current().fileExists(path)) {
             continue;
         }
-        if (auto resolved = _resolveFile(path); !resolved) {
+        if (auto resolved = _resolveFile(path, heapsnaps); !resolved) {
             return resolved;
         }
         _potentialTargetProcesses.erase(path);
@@ -93,15 +109,44 @@ MWMemweightArgs::Outcome MWMemweightArgs::_resolveFiles() {
 }
 
 /// A file that is no heapsnap can still bear the name of a process, which is then meant.
-MWMemweightArgs::Outcome MWMemweightArgs::_resolveFile(const std::string& path) {
-    const auto heapsnap = openHeapsnap(path);
+MWMemweightArgs::Outcome MWMemweightArgs::_resolveFile(const std::string& path, MWTargetMap& heapsnaps) {
+    const auto heapsnap = MWHeapsnapProcess::processWithHeapsnap(path);
+    if (heapsnap) {
+        heapsnaps[keyOfHeapsnap(path)] = *heapsnap;
+        return _adoptModeOf(**heapsnap, path);
+    }
     const auto processes = MWProcess::pidsForStringDescriptions({path}, nullptr);
     if (!processes || processes->empty()) {
         return tl::make_unexpected(resolutionError(
-            MWErrorUnreadableFile, fmt::format("Error opening heapsnap {}: {}", path, heapsnap.error())));
+            MWErrorUnreadableFile,
+            fmt::format("Error opening heapsnap {}: {}", path, heapsnap.error().description.value_or(""))));
     }
     const auto& [pid, name] = *processes->begin();
     _targetPids[pid] = name;
+    return {};
+}
+
+std::optional<int32_t> MWMemweightArgs::_pidMetTwice(const MWTargetMap& heapsnaps) const {
+    std::set<int32_t> met;
+    for (const auto& [key, heapsnap] : heapsnaps) {
+        if (_targetPids.contains(heapsnap->pid()) || !met.insert(heapsnap->pid()).second) {
+            return heapsnap->pid();
+        }
+    }
+    return std::nullopt;
+}
+
+/// All figures of a run are of one mode: that of its heapsnaps, if it has any.
+MWMemweightArgs::Outcome MWMemweightArgs::_adoptModeOf(const MWProcess& heapsnap, const std::string& path) {
+    if (_didSetShouldGetPhysMemweightBreakdown &&
+        _shouldGetPhysMemweightBreakdown != heapsnap.breakDownPhysMemweight()) {
+        return tl::make_unexpected(resolutionError(
+            MWErrorMode, fmt::format("Heapsnap was gathered with an analysis mode that conflicts with other "
+                                     "heapsnaps or command line arguments: {}",
+                                     path)));
+    }
+    _shouldGetPhysMemweightBreakdown = heapsnap.breakDownPhysMemweight();
+    _didSetShouldGetPhysMemweightBreakdown = true;
     return {};
 }
 

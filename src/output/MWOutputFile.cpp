@@ -11,10 +11,18 @@
 
 #include "platform/MWTerminalText.h"
 
-std::unique_ptr<MWOutputFile> MWOutputFile::create(const std::string& path) {
+std::unique_ptr<MWOutputFile> MWOutputFile::_open(const std::string& path, int flags) {
     constexpr mode_t kEverybodyByUmask = 0666;
-    const int descriptor = ::open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, kEverybodyByUmask);
+    const int descriptor = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | flags, kEverybodyByUmask);
     return descriptor < 0 ? nullptr : std::unique_ptr<MWOutputFile>(new MWOutputFile(path, descriptor));
+}
+
+std::unique_ptr<MWOutputFile> MWOutputFile::create(const std::string& path) {
+    return _open(path, O_TRUNC);
+}
+
+std::unique_ptr<MWOutputFile> MWOutputFile::createNew(const std::string& path) {
+    return _open(path, O_EXCL);
 }
 
 MWOutputFile::~MWOutputFile() {
@@ -34,13 +42,17 @@ void MWOutputFile::write(std::string_view bytes) {
     }
 }
 
-void MWOutputFile::close() {
+int MWOutputFile::finish() {
     const bool closed = ::close(std::exchange(_descriptor, -1)) == 0;
     if (!closed && _error == 0) {
         _error = errno;
     }
-    if (_error != 0) {
+    return _error;
+}
+
+void MWOutputFile::close() {
+    if (const int error = finish(); error != 0) {
         fmt::fprintf(stderr, "memweight: %s: %s\n", MWTerminalText(_path),
-                     std::generic_category().message(_error));
+                     std::generic_category().message(error));
     }
 }

@@ -172,6 +172,8 @@ public:
 
     /// The system's own name for a tag that the program's table does not know, or none.
     virtual std::optional<std::string> describeRegionTypeForTag(uint32_t tag) = 0;
+    /// The tag that the system gives to memory with a name of its own, the same throughout a run.
+    virtual uint32_t tagForRegionType(const std::string& name) = 0;
     /// Calls back once for each image loaded in the task at the time of the call.
     virtual void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) = 0;
 

@@ -55,8 +55,12 @@ bool MWUserProcess::_initWithBsdInfo(const proc_bsdinfo& info) {
     return true;
 }
 
+bool MWUserProcess::_hasSharedCache() const {
+    return MWHostInterface::current().hasSharedCache(*_task);
+}
+
 int MWUserProcess::_platformCode() const {
-    if (!MWHostInterface::current().hasSharedCache(*_task)) {
+    if (!_hasSharedCache()) {
         return MWPlatformNoSharedCache;
     }
     if (isTranslated()) {

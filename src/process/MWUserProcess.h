@@ -122,6 +122,8 @@ protected:
 
     /// Fills `_images` from one listing of the images that are loaded now.
     virtual void _gatherImageData();
+    /// Whether processes of the system that it runs on, or ran on, have a shared cache.
+    virtual bool _hasSharedCache() const;
     /// Chooses the shared cache's place by platform; false for MWPlatformUnknown.
     virtual bool _setSharedRegionFromPlatform(int platformCode);
     /// Cuts one shared-cache mapping into a region for each image segment and one for each stretch between

@@ -147,6 +147,97 @@ TEST(EndToEnd, TheKernelIsAProcessForWhoeverLooks) {
     }
 }
 
+std::string contentsOf(const std::filesystem::path& path) {
+    std::ifstream file(path);
+    return {std::istreambuf_iterator<char>(file), {}};
+}
+
+TEST(EndToEnd, HeapsnapsOfOtherPlatformsAreReported) {
+    const std::filesystem::path folder = MEMWEIGHT_HEAPSNAPS;
+    for (const char* name : {"shared-cache", "purgeable-16k", "translated-32bit"}) {
+        const Report report = memweight("-v -w " + (folder / name).string() + ".heapsnap");
+        EXPECT_EQ(report.text, contentsOf((folder / name).string() + ".txt")) << name;
+        EXPECT_EQ(report.status, 0);
+    }
+    const Report refused = memweight((folder / "shared-cache.txt").string());
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_TRUE(refused.contains("shared-cache.txt: not valid JSON at byte 1\n")) << refused.text;
+}
+
+/// A folder for heapsnaps, and the program that writes them run in it.
+class SavedProcesses : public testing::Test {
+protected:
+    void SetUp() override { ASSERT_NE(mkdtemp(_folder.data()), nullptr); }
+    void TearDown() override { std::filesystem::remove_all(_folder); }
+    /// Runs memweight-heapsnap: its exit status, and what it tells.
+    std::pair<int, std::string> save(const std::string& arguments) {
+        const std::string messages = _folder + "/messages";
+        const std::string command = "cd " + _folder + " && " + MEMWEIGHT_HEAPSNAP_BINARY + " " + arguments;
+        const int status = std::system((command + " > " + messages + " 2>&1").c_str());
+        return {WEXITSTATUS(status), contentsOf(messages)};
+    }
+    std::string _folder = testing::TempDir() + "memweight-XXXXXX";
+};
+
+TEST_F(SavedProcesses, AreReportedLikeTheLivingOnes) {
+    const int memfd = memfd_create("end-to-end", 0);
+    ASSERT_EQ(ftruncate(memfd, 64 * kPage), 0);
+    const ChildProcess low([=] { return touchPages(memfd, 0, 30); });
+    const ChildProcess high([=] { return touchPages(memfd, 0, 30); });
+    close(memfd);
+    const std::string pids[] = {std::to_string(low.pid()), std::to_string(high.pid())};
+    for (const std::string& pid : pids) {
+        EXPECT_EQ(save(pid), (std::pair<int, std::string>(0, "")));
+    }
+    const Report live = memweight("--pid " + pids[0] + " --pid " + pids[1]);
+    const Report saved = memweight(_folder + "/*.heapsnap");
+    ASSERT_EQ(saved.status, 0) << saved.text;
+    const std::string others = "Shared with cli_tests [" + pids[0] + "]";
+    const auto& liveShared = live.tables.at(others + ":");
+    const auto& savedShared = saved.tables.at(others + " (heapsnap):");
+    ASSERT_GE(savedShared.size(), 3U);
+    for (const auto& [category, row] : liveShared) {
+        ASSERT_TRUE(savedShared.contains(category)) << category;
+        const Row& same = savedShared.at(category);
+        EXPECT_EQ(std::tie(same[0], same[2], same[3]), std::tie(row[0], row[2], row[3])) << category;
+    }
+    for (auto& [category, row] : live.tables.at(kSummary)) {
+        if (category != "page table") {
+            EXPECT_EQ(saved.dirty(kSummary, category), row[0]) << category;
+        }
+    }
+}
+
+TEST_F(SavedProcesses, AreNeverOverwrittenUnasked) {
+    const ChildProcess process;
+    const std::string pid = std::to_string(process.pid());
+    const std::string file = "cli_tests-" + pid + ".heapsnap";
+    std::ofstream(_folder + "/" + file) << "precious";
+    EXPECT_EQ(save(pid), (std::pair<int, std::string>(1, "memweight-heapsnap: " + file + ": File exists\n")));
+    EXPECT_EQ(contentsOf(_folder + "/" + file), "precious");
+    EXPECT_EQ(save("--force " + pid).first, 0);
+    EXPECT_TRUE(contentsOf(_folder + "/" + file).starts_with("{\"format\""));
+    EXPECT_EQ(save("--vmObjectDirty -o other " + pid).first, 0);
+    EXPECT_EQ(nlohmann::json::parse(contentsOf(_folder + "/other"))["breakdown"], false);
+    const std::pair<std::string, std::string> refused[] = {
+        {"--force -o /dev/full " + pid, "memweight-heapsnap: /dev/full: not a regular file\n"},
+        {"-o none/file " + pid, "memweight-heapsnap: none/file: No such file or directory\n"},
+        {"12abc", "memweight-heapsnap: 12abc: not a pid\n"},
+        {"0", "memweight-heapsnap: 0: not a pid\n"},
+        {"2147483647", "memweight-heapsnap: 2147483647: unable to read this process (try as root?)\n"},
+    };
+    for (const auto& [arguments, message] : refused) {
+        EXPECT_EQ(save(arguments), std::pair(1, message));
+    }
+    EXPECT_EQ(save("").first, 1);
+    EXPECT_EQ(save("--help").first, 0);
+    size_t files = 0;
+    for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator(_folder)) {
+        ++files;
+    }
+    EXPECT_EQ(files, 3U) << "two heapsnaps and the messages; nothing temporary";
+}
+
 /// Goes on taking memory, a little at a time, up to 100 MiB.
 uint64_t grow() {
     std::thread([] {

@@ -3,6 +3,7 @@
 #include "cli/CommandLine.h"
 #include "cli/MWMemweightArgs.h"
 #include "support/FakeHost.h"
+#include "support/RecordedTree.h"
 
 namespace {
 
@@ -41,14 +42,14 @@ struct Resolved {
     MWTargetResolution resolution;
 };
 
-Resolved resolve(MWMemweightArgs& args) {
+Resolved resolve(MWMemweightArgs& args, bool keysArePids = true) {
     testing::internal::CaptureStderr();
     Resolved result = {.pids = {}, .error = {}, .standardError = {}, .resolution = args.targetProcesses()};
     result.standardError = testing::internal::GetCapturedStderr();
     if (const auto& targets = result.resolution.targets) {
         result.pids.emplace();
         for (const auto& [key, process] : *targets) {
-            EXPECT_EQ(process->pid(), key);
+            EXPECT_TRUE(!keysArePids || process->pid() == key);
             result.pids->push_back(key);
         }
     }
@@ -125,9 +126,65 @@ TEST(MWTargetResolution, TellsWhatItCannotTake) {
                           "Unable to analyze process with pid 777 (try as root?)\n",
          .refused = {12}},
         {.arguments = {"/tmp", "shell"},
-         .error = "7: Error opening heapsnap /tmp: reading heapsnap files is not built yet",
+         .error = "7: Error opening heapsnap /tmp: Is a directory",
          .files = {"/tmp"}},
     });
+}
+
+class HeapsnapTargets : public RecordedTree {
+protected:
+    std::string heapsnap(int pid, bool breakdown) {
+        const std::string name = std::to_string(pid) + (breakdown ? "a" : "b");
+        write(name, R"({"format": "heapsnap", "version": 1, "process": {"pid": )" + std::to_string(pid) +
+                        R"(, "name": "saved", "is64bit": true, "description": "X86"}, "page_size": 4096,)" +
+                        R"("regions": [], "breakdown": )" + (breakdown ? "true}" : "false}"));
+        _host.files.insert(place(name));
+        return place(name);
+    }
+    /// The display strings of the targets, or the error.
+    std::string targets(const std::vector<std::string>& arguments) {
+        MWMemweightArgs args = parsed(arguments);
+        const auto found = resolve(args, false);
+        std::string text = found.error;
+        for (const auto& [key, process] : found.resolution.targets.value_or(MWTargetMap())) {
+            EXPECT_EQ(key < 0, process->displayString().ends_with(" (heapsnap)"));
+            text += process->displayString() + ";";
+        }
+        EXPECT_EQ(args.didSetShouldGetPhysMemweightBreakdown(), found.resolution.targets.has_value());
+        return text;
+    }
+    FamilyHost _host;
+};
+
+TEST_F(HeapsnapTargets, AreTargetsBesideProcesses) {
+    EXPECT_EQ(targets({heapsnap(7, true)}), "saved [7] (heapsnap);");
+    EXPECT_EQ(targets({heapsnap(7, true), "shell"}), "saved [7] (heapsnap);shell [20];");
+}
+
+TEST_F(HeapsnapTargets, OneModeForAll) {
+    const std::string conflict =
+        "6: Heapsnap was gathered with an analysis mode that conflicts with other heapsnaps or command line "
+        "arguments: ";
+    EXPECT_EQ(targets({"--vmObjectDirty", heapsnap(7, false)}), "saved [7] (heapsnap);");
+    const CommandLine line({"--vmObjectDirty", heapsnap(7, true)});
+    MWMemweightArgs args = MWMemweightArgs::initWithArgc(line.argc(), line.argv()).value();
+    EXPECT_EQ(resolve(args, false).error, conflict + heapsnap(7, true));
+    args = parsed({heapsnap(7, true), heapsnap(8, false)});
+    EXPECT_TRUE(resolve(args, false).error.starts_with(conflict));
+    args = parsed({heapsnap(8, false)});
+    resolve(args, false);
+    EXPECT_FALSE(args.shouldGetPhysMemweightBreakdown());
+}
+
+TEST_F(HeapsnapTargets, OnePidIsOneTarget) {
+    const std::string twice =
+        "7: There is more than one target with pid 20: measure heapsnaps of the same pid one at a time";
+    for (const auto& arguments : {std::vector{heapsnap(20, true), std::string("shell")},
+                                  std::vector{heapsnap(20, true), _top + "/./20a"}}) {
+        _host.files.insert(arguments.back());
+        MWMemweightArgs args = parsed(arguments);
+        EXPECT_EQ(resolve(args).error, twice);
+    }
 }
 
 TEST(MWTargetResolution, UnmappedAddsAllOtherProcessesHidden) {

@@ -106,6 +106,7 @@ public:
     std::set<int> terminals;
     std::set<std::string> files;  ///< existing paths
     std::map<uint32_t, std::string> tagDescriptions;
+    std::map<std::string, uint32_t> tagsOfNames;
 
     std::vector<std::string> ledgerNames;
     int ledgerTemplateError = 0;
@@ -169,6 +170,7 @@ public:
     std::string mach_error_string(kern_return_t code) override { return "code " + std::to_string(code); }
     void mach_error(std::string_view label, kern_return_t code) override;
     std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
+    uint32_t tagForRegionType(const std::string& name) override { return tagsOfNames[name]; }
     void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
     int mach_get_times(MWClockReading& reading) override {
         reading = clockFails ? reading : clock;

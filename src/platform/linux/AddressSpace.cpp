@@ -288,12 +288,14 @@ private:
                 break;
         }
         const uint64_t window = run.start / MWFamilyWindow * MWFamilyWindow;
-        return {_context.identity.family({.family = _family().identifier(),
-                                          .window = window,
-                                          .file = use.file == 0 ? 0 : use.file + (vma.writable ? 1 : 0),
-                                          .tag = use.file == 0 ? use.tag : MWTagNone,
-                                          .generation = run.generation}),
-                run.start};
+        return {
+            _context.identity.family(
+                {.family = _family().identifier(),
+                 .window = window,
+                 .file = use.file == 0 ? 0 : use.file + (vma.writable ? 1 : 0),
+                 .tag = use.file == 0 ? _context.names.lastingNumber(use.tag, _context.identity) : MWTagNone,
+                 .generation = run.generation}),
+            run.start};
     }
 
     const AddressSpaceOwner& _owner;

@@ -82,6 +82,7 @@ public:
     void mach_error(std::string_view label, kern_return_t code) override;
 
     std::optional<std::string> describeRegionTypeForTag(uint32_t tag) override;
+    uint32_t tagForRegionType(const std::string& name) override { return _run.names.tagForName(name); }
     /// From the task's snapshot, which is taken when there is none: the walk that follows goes on with it.
     void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
 

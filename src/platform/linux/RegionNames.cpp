@@ -25,3 +25,9 @@ std::optional<std::string> RegionNames::nameForTag(uint32_t tag) const {
     }
     return std::nullopt;
 }
+
+uint32_t RegionNames::lastingNumber(uint32_t tag, const ObjectIdentity& identity) const {
+    constexpr uint32_t kNamed = 0x80000000;
+    const auto name = nameForTag(tag);
+    return name ? static_cast<uint32_t>(identity.bytes(*name)) | kNamed : tag;
+}

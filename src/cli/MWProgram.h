@@ -1,0 +1,4 @@
+#pragma once
+
+/// What every program of this package does before anything else.
+void MWPrepareProgram();
