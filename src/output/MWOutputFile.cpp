@@ -14,7 +14,10 @@
 std::unique_ptr<MWOutputFile> MWOutputFile::_open(const std::string& path, int flags) {
     constexpr mode_t kEverybodyByUmask = 0666;
     const int descriptor = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | flags, kEverybodyByUmask);
-    return descriptor < 0 ? nullptr : std::unique_ptr<MWOutputFile>(new MWOutputFile(path, descriptor));
+    if (descriptor < 0) {
+        return nullptr;
+    }
+    return std::unique_ptr<MWOutputFile>(new MWOutputFile(path, descriptor));
 }
 
 std::unique_ptr<MWOutputFile> MWOutputFile::create(const std::string& path) {

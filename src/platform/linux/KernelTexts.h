@@ -49,7 +49,7 @@ struct VmallocCaller {
     std::string name() const;
     std::string function() const;
     uint64_t address() const;
-    auto operator<=>(const VmallocCaller&) const = default;
+    bool operator<(const VmallocCaller& other) const { return call < other.call; }
 };
 /// `vmallocinfo`: pages by caller. Areas that hold no memory of the kernel's are left out.
 std::map<VmallocCaller, uint64_t> parseVmallocinfo(std::string_view text);
