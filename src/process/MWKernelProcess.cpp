@@ -12,7 +12,7 @@
 #include "platform/MWKernelTags.h"
 #include "platform/MWTerminalText.h"
 #include "platform/MWUTF8.h"
-#include "process/MWSizeMath.h"
+#include "platform/MWSizeMath.h"
 
 namespace {
 
@@ -147,6 +147,7 @@ void MWKernelProcess::gatherData() {
         _addError(fmt::format("{}: {}", displayString(), host.mach_error_string(result)));
         return;
     }
+    _auxData.clear();
     MWMemoryRegionList regions;
     const size_t zoneCount = std::min(arrays.zoneNames.size(), arrays.zones.size());
     for (size_t index = 0; index < zoneCount; ++index) {

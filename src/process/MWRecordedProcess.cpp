@@ -7,7 +7,7 @@
 #include <string_view>
 
 #include "platform/MWHostInterface.h"
-#include "process/MWSizeMath.h"
+#include "platform/MWSizeMath.h"
 
 namespace {
 

@@ -1,7 +1,7 @@
 #include <fmt/core.h>
 
 #include "platform/MWRegionTags.h"
-#include "process/MWSizeMath.h"
+#include "platform/MWSizeMath.h"
 #include "process/MWUserProcess.h"
 
 namespace {

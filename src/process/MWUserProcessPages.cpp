@@ -3,7 +3,7 @@
 
 #include "platform/MWHostInterface.h"
 #include "platform/MWInvariant.h"
-#include "process/MWSizeMath.h"
+#include "platform/MWSizeMath.h"
 #include "process/MWUserProcess.h"
 
 namespace {

@@ -1,7 +1,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "process/MWSizeMath.h"
+#include "platform/MWSizeMath.h"
 #include "process/MWUserProcess.h"
 
 namespace {

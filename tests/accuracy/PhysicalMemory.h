@@ -10,8 +10,8 @@
 /// code of the program.
 
 /// Every page frame and every swap entry that any of the processes maps, once: anonymous memory that was not
-/// lazily freed, shmem, huge pages and dirty file pages; and the page tables of each address space. Without the
-/// zero page, clean file pages and the swapped part of shmem. Root only.
+/// lazily freed, shmem, huge pages and dirty file pages; and the page tables of each address space. Without
+/// the zero page, clean file pages and the swapped part of shmem. Root only.
 uint64_t physicalMemoryOf(const std::vector<pid_t>& pids);
 
 /// What a process is to be charged, by its `status` and `smaps`: anonymous memory that was not lazily freed,

@@ -175,6 +175,18 @@ TEST_F(KernelProcess, CountersAreNoMemory) {
     EXPECT_EQ(_process->auxData()->mergeWithData(nullptr), nullptr) << "not added up over processes";
 }
 
+TEST_F(KernelProcess, GatheringAgainAsksAnew) {
+    _host.kernelZones = {{"zone", {}}};
+    _host.kernelRecords = {counter(1, 1)};
+    gather();
+    _host.kernelZones = {{"other", {}}, {"third", {}}};
+    _host.kernelRecords = {counter(2, 1)};
+    _process->gatherData();
+    EXPECT_EQ(names(), (std::vector<std::string>{"other", "third"}));
+    EXPECT_EQ(counters()["Maps"].size(), 1U);
+    EXPECT_TRUE(counters()["Maps"].contains("VM_KERN_COUNT_PER_CPU_FREE"));
+}
+
 TEST_F(KernelProcess, FailuresAreTold) {
     _host.kernelMemoryResult = KERN_FAILURE;
     gather();

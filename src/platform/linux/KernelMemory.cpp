@@ -12,7 +12,9 @@
 #include <utility>
 
 #include "platform/MWKernelTags.h"
+#include "platform/MWSizeMath.h"
 #include "platform/linux/KernelTexts.h"
+#include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
 
 namespace {
@@ -24,10 +26,6 @@ using procfs::VmallocCaller;
 using Functions = std::span<const std::string_view>;
 
 constexpr size_t kLongestText = 256U << 20U;
-
-uint64_t lessAtMost(uint64_t a, uint64_t b) {
-    return a > b ? a - b : 0;
-}
 
 template <size_t N>
 void copyText(std::array<char, N>& to, std::string_view from) {
@@ -61,6 +59,19 @@ mach_memory_info_t recordOf(MWSiteType type, uint64_t site, uint64_t bytes) {
     return record;
 }
 
+uint64_t pageTablesOfProcesses(int procDirectory) {
+    uint64_t sum = 0;
+    std::string text;
+    procfs::forEachEntry(procDirectory, ".", [&](int processes, const char* name) {
+        if (*name >= '1' && *name <= '9' &&
+            procfs::readFile(processes, (std::string(name) + "/status").c_str(), text)) {
+            sum = MWSaturatingAdd(sum, procfs::parseStatus(text).vmPte);
+        }
+        return true;
+    });
+    return sum;
+}
+
 bool isReclaimable(int sysDirectory, const std::string& cache) {
     std::string text;
     if (cache.find('/') == std::string::npos &&
@@ -77,7 +88,7 @@ public:
     VmallocMemory(std::string_view vmallocinfo, uint64_t total, uint64_t pageSize)
         : _isKnown(!vmallocinfo.empty()) {
         for (const auto& [caller, pages] : procfs::parseVmallocinfo(vmallocinfo)) {
-            _bytes[caller] = pages * pageSize;
+            _bytes[caller] = MWSaturatingMultiply(pages, pageSize);
         }
         if (!_isKnown) {
             _bytes[VmallocCaller()] = total;
@@ -85,12 +96,7 @@ public:
     }
 
     const std::map<VmallocCaller, uint64_t>& bytes() const { return _bytes; }
-
-    /// Whether some of it was got through these functions; true where the callers are not told.
-    bool isUsedBy(Functions functions) const {
-        return std::ranges::any_of(_bytes,
-                                   [&](const auto& entry) { return _isOneOf(entry.first, functions); });
-    }
+    bool callersAreKnown() const { return _isKnown; }
 
     /// Takes as much of `bytes` as there is; how much that was.
     uint64_t take(Functions functions, uint64_t bytes) {
@@ -107,7 +113,10 @@ public:
 
 private:
     bool _isOneOf(const VmallocCaller& caller, Functions functions) const {
-        return !_isKnown || std::ranges::find(functions, caller.function()) != functions.end();
+        // Of a function that the compiler split or specialized the parts are told apart by a suffix.
+        const std::string function = caller.function();
+        const std::string_view plain = std::string_view(function).substr(0, function.find('.'));
+        return !_isKnown || std::ranges::find(functions, plain) != functions.end();
     }
 
     bool _isKnown;
@@ -123,6 +132,7 @@ constexpr std::string_view kStackMakers[] = {"kernel_clone",
                                              "create_io_thread",
                                              "alloc_thread_stack_node",
                                              "vhost_task_create"};
+constexpr std::string_view kShadowStackMakers[] = {"scs_alloc", "__scs_alloc", "scs_prepare"};
 constexpr std::string_view kModuleLoaders[] = {"move_module",          "load_module",
                                                "layout_and_allocate",  "module_alloc",
                                                "module_memory_alloc",  "execmem_alloc",
@@ -130,20 +140,33 @@ constexpr std::string_view kModuleLoaders[] = {"move_module",          "load_mod
                                                "execmem_cache_alloc",  "execmem_cache_populate",
                                                "init_module_from_file"};
 
-enum class Allocation : uint8_t { kernel, ofProcess, leftOut };
-
 // Allocators that get their memory from another one appear twice, with what they got and with what they gave:
-// their own lines are left out. So are pages of processes and files.
-Allocation kindOf(const AllocationSite& site) {
-    constexpr std::string_view kLeftOut[] = {
-        "mm/slub.c",       "mm/percpu-vm.c", "mm/percpu-km.c",   "mm/memory.c",     "mm/filemap.c",
-        "mm/readahead.c",  "mm/shmem.c",     "mm/huge_memory.c", "mm/hugetlb.c",    "mm/mempolicy.c",
-        "mm/swap_state.c", "mm/migrate.c",   "mm/khugepaged.c",  "mm/compaction.c", "mm/userfaultfd.c"};
-    if (std::ranges::find(kLeftOut, site.file) != std::end(kLeftOut)) {
-        return Allocation::leftOut;
-    }
-    return site.file.ends_with("/pgalloc.h") || site.file.ends_with("mm/pgtable.c") ? Allocation::ofProcess
-                                                                                    : Allocation::kernel;
+// their own lines are left out. So are pages of processes and files, and page tables, which other figures
+// tell.
+bool isToldElsewhere(const AllocationSite& site) {
+    constexpr std::string_view kFiles[] = {"mm/slub.c",
+                                           "mm/percpu-vm.c",
+                                           "mm/percpu-km.c",
+                                           "mm/memory.c",
+                                           "mm/filemap.c",
+                                           "mm/readahead.c",
+                                           "mm/shmem.c",
+                                           "mm/huge_memory.c",
+                                           "mm/hugetlb.c",
+                                           "mm/mempolicy.c",
+                                           "mm/swap_state.c",
+                                           "mm/migrate.c",
+                                           "mm/khugepaged.c",
+                                           "mm/compaction.c",
+                                           "mm/userfaultfd.c",
+                                           "mm/ksm.c",
+                                           "arch/arm64/mm/fault.c",
+                                           "fs/btrfs/extent_io.c",
+                                           "fs/btrfs/compression.c"};
+    std::string_view file = site.file;
+    procfs::takePrefix(file, "./");
+    return std::ranges::find(kFiles, file) != std::end(kFiles) || file == "include/linux/highmem.h" ||
+           file.ends_with("/pgalloc.h") || file.ends_with("mm/pgtable.c") || file == "mm/pgtable-generic.c";
 }
 
 class KernelMemoryReading {
@@ -154,41 +177,67 @@ public:
         refreshStatistics(_sources.procDirectory);
         _meminfo = procfs::parseMeminfo(_text("meminfo"));
         _vmstat = procfs::parseVmstat(_text("vmstat"));
-        _perCpuFree = procfs::pagesInPerCpuLists(_text("zoneinfo")) * _sources.pageSize;
+        _perCpuFree = _bytesOf(procfs::pagesInPerCpuLists(_text("zoneinfo")));
         if (!_addAllocations()) {
             _addSlabCaches();
             _addVmalloc();
             _addTags();
         }
+        _addPageTables();
         if (_memory.zones.empty() && _memory.records.empty() && _meminfo.empty()) {
             return std::nullopt;
         }
         _addCounters();
         _addTag(MWKernelTagUserWired, _meminfo["Mlocked"]);
+        _addTag(MWKernelTagBalloon, _meminfo["Balloon"], MWSiteHidden);
         return std::move(_memory);
     }
 
 private:
     std::string _text(const char* name) const { return readText(_sources.procDirectory, name); }
+    uint64_t _bytesOf(uint64_t pages) const { return MWSaturatingMultiply(pages, _sources.pageSize); }
+
+    // Every page of a process or a file is on one of the lists from which pages are reclaimed, on one at a
+    // time.
+    uint64_t _userMemory() const { return _meminfo.sum({"Active", "Inactive", "Unevictable", "Hugetlb"}); }
+    uint64_t _kernelMemory() const {
+        const uint64_t inUse = MWSaturatingSubtract(_meminfo["MemTotal"], _meminfo["MemFree"]);
+        return MWSaturatingSubtract(inUse, MWSaturatingAdd(_userMemory(), _perCpuFree));
+    }
+
+    // Profiling that was switched on late knows a part, and a newer kernel may have pages of processes in
+    // lines that are not known for it: sums that cannot be right leave the coarser sources in force.
+    bool _areCredible(const std::vector<AllocationSite>& sites) const {
+        uint64_t sum = 0;
+        for (const AllocationSite& site : sites) {
+            sum = MWSaturatingAdd(sum, site.bytes);
+        }
+        const uint64_t atLeast = (_meminfo["Slab"] + _meminfo["VmallocUsed"]) / 2;
+        const uint64_t atMost = _kernelMemory();
+        return sum != 0 && sum >= atLeast && sum <= MWSaturatingAdd(atMost, atMost / 10);
+    }
 
     // False without allocation profiling, also where the kernel has it and it is switched off.
     bool _addAllocations() {
+        if (!_text("sys/vm/mem_profiling").starts_with('1')) {
+            return false;
+        }
+        auto sites = procfs::parseAllocinfo(_text("allocinfo"));
+        std::erase_if(sites, isToldElsewhere);
+        if (!_areCredible(sites)) {
+            return false;
+        }
         auto locations = std::make_shared<KernelSourceLocations>();
-        uint64_t index = 0;
-        for (const AllocationSite& site : procfs::parseAllocinfo(_text("allocinfo"))) {
-            const uint64_t number = siteNumber(++index);
-            const Allocation kind = kindOf(site);
-            if (site.bytes == 0 || kind == Allocation::leftOut) {
+        for (size_t index = 0; index < sites.size(); ++index) {
+            const AllocationSite& site = sites[index];
+            if (site.bytes == 0) {
                 continue;
             }
+            const uint64_t number = siteNumber(index + 1);
             mach_memory_info_t record = recordOf(MWSiteKernel, number, site.bytes);
-            record.flags |= kind == Allocation::ofProcess ? MWSiteHidden : 0;
             _name(record, site.module.empty() ? site.function : site.function + " [" + site.module + "]");
             _add(record);
             locations->insert({number, {.path = site.file, .line = site.line}});
-        }
-        if (_memory.records.empty()) {
-            return false;
         }
         _memory.locations = std::move(locations);
         return true;
@@ -204,9 +253,9 @@ private:
         }
         uint64_t sum = 0;
         for (const procfs::SlabCache& cache : caches) {
-            const uint64_t slabSize = cache.pagesPerSlab * _sources.pageSize;
-            const uint64_t bytes = cache.slabs * slabSize;
-            sum += bytes;
+            const uint64_t slabSize = _bytesOf(cache.pagesPerSlab);
+            const uint64_t bytes = MWSaturatingMultiply(cache.slabs, slabSize);
+            sum = MWSaturatingAdd(sum, bytes);
             // Some of the active objects are only thought to be: never more than there is room for.
             const uint64_t room = cache.objectSize == 0 ? 0 : bytes / cache.objectSize;
             _addZone(cache.name,
@@ -216,7 +265,7 @@ private:
                       .mzi_alloc_size = slabSize,
                       .mzi_collectable = isReclaimable(_sources.sysDirectory, cache.name) ? 1U : 0U});
         }
-        _addZone("kmalloc-large", {.mzi_cur_size = lessAtMost(_meminfo["Slab"], sum)});
+        _addZone("kmalloc-large", {.mzi_cur_size = MWSaturatingSubtract(_meminfo["Slab"], sum)});
     }
 
     void _addZone(std::string_view name, const mach_zone_info_t& zone) {
@@ -225,22 +274,17 @@ private:
         }
         copyText(_memory.zoneNames.emplace_back().mzn_name, name);
         _memory.zones.push_back(zone);
-        _accounted += zone.mzi_cur_size;
+        _accounted = MWSaturatingAdd(_accounted, zone.mzi_cur_size);
     }
 
     void _addVmalloc() {
         VmallocMemory vmalloc(_text("vmallocinfo"), _meminfo["VmallocUsed"], _sources.pageSize);
-        const uint64_t stacks = _meminfo["KernelStack"];
         // Kernels are built with stacks in this memory or outside of it.
-        _addTag(MWKernelTagStack,
-                vmalloc.isUsedBy(kStackMakers) ? vmalloc.take(kStackMakers, stacks) : stacks);
-        uint64_t index = 0;
-        for (const procfs::LoadedModule& module : procfs::parseModules(_text("modules"))) {
-            const uint64_t number = siteNumber(++index);
-            if (const uint64_t bytes = vmalloc.take(kModuleLoaders, module.bytes); bytes != 0) {
-                _add(recordOf(MWSiteExtension, number, bytes));
-            }
-        }
+        const uint64_t stacks = _meminfo["KernelStack"];
+        const uint64_t stacksHere = vmalloc.take(kStackMakers, stacks);
+        _addTag(MWKernelTagStack, vmalloc.callersAreKnown() && stacksHere != 0 ? stacksHere : stacks);
+        _addTag(MWKernelTagShadowCallStack, vmalloc.take(kShadowStackMakers, _meminfo["ShadowCallStack"]));
+        _addModules(vmalloc);
         for (const auto& [caller, bytes] : vmalloc.bytes()) {
             if (caller.call.empty()) {
                 _addTag(MWKernelTagVmalloc, bytes);
@@ -252,17 +296,34 @@ private:
         }
     }
 
+    // The load tag of a module is its place in the list.
+    void _addModules(VmallocMemory& vmalloc) {
+        for (procfs::LoadedModule& module : procfs::parseModules(_text("modules"))) {
+            const uint64_t number = siteNumber(_memory.modules.size() + 1);
+            if (const uint64_t bytes = vmalloc.take(kModuleLoaders, module.bytes); bytes != 0) {
+                _add(recordOf(MWSiteExtension, number, bytes));
+            }
+            _memory.modules.push_back(
+                {.OSBundleLoadTag = number, .bundleIdentifier = std::move(module.name)});
+        }
+    }
+
+    // Processes are charged for their own, but not for the topmost level of each and not for the kernel's.
+    void _addPageTables() {
+        const uint64_t all = _meminfo["PageTables"];
+        const uint64_t charged = all == 0 ? 0 : std::min(all, pageTablesOfProcesses(_sources.procDirectory));
+        _addTag(MWKernelTagPageTables, charged, MWSiteHidden);
+        _addTag(MWKernelTagPageTables, all - charged);
+    }
+
     void _addTags() {
-        // Processes are charged for their page tables.
-        _addTag(MWKernelTagPageTables, _meminfo["PageTables"], MWSiteHidden);
         _addTag(MWKernelTagSecondaryPageTables, _meminfo["SecPageTables"]);
-        _addTag(MWKernelTagShadowCallStack, _meminfo["ShadowCallStack"]);
         _addTag(MWKernelTagPerCpu, _meminfo["Percpu"]);
-        _addTag(MWKernelTagReclaimable, lessAtMost(_meminfo["KReclaimable"], _meminfo["SReclaimable"]));
+        _addTag(MWKernelTagReclaimable,
+                MWSaturatingSubtract(_meminfo["KReclaimable"], _meminfo["SReclaimable"]));
         _addTag(MWKernelTagZswap, _meminfo["Zswap"]);
-        _addTag(MWKernelTagZsmalloc, lessAtMost(_pages("nr_zspages"), _meminfo["Zswap"]));
+        _addTag(MWKernelTagZsmalloc, MWSaturatingSubtract(_pages("nr_zspages"), _meminfo["Zswap"]));
         _addTag(MWKernelTagBounce, _meminfo["Bounce"]);
-        _addTag(MWKernelTagBalloon, _meminfo["Balloon"]);
         _addTag(MWKernelTagHardwareCorrupted, _meminfo["HardwareCorrupted"]);
         _addTag(MWKernelTagWriteback, _meminfo["WritebackTmp"]);
         _addTag(MWKernelTagPageMap, _pages("nr_memmap_pages"));
@@ -280,7 +341,7 @@ private:
 
     void _add(const mach_memory_info_t& record) {
         _memory.records.push_back(record);
-        _accounted += record.size;
+        _accounted = MWSaturatingAdd(_accounted, record.size);
     }
 
     static void _name(mach_memory_info_t& record, std::string_view name) {
@@ -292,16 +353,12 @@ private:
         if (_meminfo.empty()) {
             return;
         }
-        // Every page of a process or a file is in one of the lists from which pages are reclaimed, in one at
-        // a time.
-        const uint64_t user = _meminfo.sum({"Active", "Inactive", "Unevictable", "Hugetlb"});
-        const uint64_t inUse = lessAtMost(_meminfo["MemTotal"], _meminfo["MemFree"]);
         _addCounter(MWKernelCounterManaged, _meminfo["MemTotal"]);
         _addCounter(MWKernelCounterFree, _meminfo["MemFree"]);
         _addCounter(MWKernelCounterPerCpuFree, _perCpuFree);
         _addCounter(MWKernelCounterAvailable, _meminfo["MemAvailable"]);
-        _addCounter(MWKernelCounterUser, user);
-        _addCounter(MWKernelCounterUnaccounted, lessAtMost(inUse, user + _perCpuFree + _accounted));
+        _addCounter(MWKernelCounterUser, _userMemory());
+        _addCounter(MWKernelCounterUnaccounted, MWSaturatingSubtract(_kernelMemory(), _accounted));
         _addCounter(MWKernelCounterSlab, _meminfo["Slab"]);
         _addCounter(MWKernelCounterVmalloc, _meminfo["VmallocUsed"]);
         _addCounter(MWKernelCounterCommitted, _meminfo["Committed_AS"]);
@@ -318,7 +375,12 @@ private:
         _memory.records.push_back(record);
     }
 
-    uint64_t _pages(std::string_view name) const { return _vmstat[name] * _sources.pageSize; }
+    /// What the kernel counts up and down at different processors can be told as less than nothing, which
+    /// reads as a number beyond all memory.
+    uint64_t _pages(std::string_view name) const {
+        const uint64_t bytes = _bytesOf(_vmstat[name]);
+        return bytes <= _meminfo["MemTotal"] ? bytes : 0;
+    }
 
     KernelMemorySources _sources;
     Figures _meminfo;
@@ -332,13 +394,4 @@ private:
 
 std::optional<KernelMemory> readKernelMemory(const KernelMemorySources& sources) {
     return KernelMemoryReading(sources).read();
-}
-
-std::vector<MWKernelExtension> readKernelModules(int procDirectory) {
-    std::vector<MWKernelExtension> modules;
-    for (procfs::LoadedModule& module : procfs::parseModules(readText(procDirectory, "modules"))) {
-        modules.push_back(
-            {.OSBundleLoadTag = siteNumber(modules.size() + 1), .bundleIdentifier = std::move(module.name)});
-    }
-    return modules;
 }

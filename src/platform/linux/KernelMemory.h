@@ -20,6 +20,7 @@ struct KernelMemory {
     std::vector<mach_zone_name_t> zoneNames;
     std::vector<mach_zone_info_t> zones;
     std::vector<mach_memory_info_t> records;
+    std::vector<MWKernelExtension> modules;
     std::shared_ptr<const KernelSourceLocations> locations;  ///< none unless the records are made from them
 };
 
@@ -27,7 +28,3 @@ struct KernelMemory {
 /// callers of vmalloc, modules and the figures of `meminfo`. Without privilege, `meminfo` alone. None when
 /// nothing can be read.
 std::optional<KernelMemory> readKernelMemory(const KernelMemorySources& sources);
-
-/// The modules with their load tags, which are their places in the list; 24 is left out, as a site of this
-/// number is memory of processes.
-std::vector<MWKernelExtension> readKernelModules(int procDirectory);

@@ -4,6 +4,7 @@
 #include <array>
 #include <optional>
 
+#include "platform/MWSizeMath.h"
 #include "platform/linux/ProcText.h"
 
 namespace procfs {
@@ -108,7 +109,7 @@ uint64_t Figures::operator[](std::string_view name) const {
 uint64_t Figures::sum(std::initializer_list<std::string_view> names) const {
     uint64_t sum = 0;
     for (const std::string_view name : names) {
-        sum += (*this)[name];
+        sum = MWSaturatingAdd(sum, (*this)[name]);
     }
     return sum;
 }
@@ -142,7 +143,7 @@ uint64_t pagesInPerCpuLists(std::string_view zoneinfo) {
     while (!zoneinfo.empty()) {
         std::string_view line = takeLine(zoneinfo);
         if (takeWord(line) == "count:") {
-            pages += numberOf(takeWord(line)).value_or(0);
+            pages = MWSaturatingAdd(pages, numberOf(takeWord(line)).value_or(0));
         }
     }
     return pages;
@@ -181,7 +182,8 @@ std::map<VmallocCaller, uint64_t> parseVmallocinfo(std::string_view text) {
             } else if (word.starts_with('[')) {
                 caller.call += " " + std::string(word);
             } else if (takePrefix(word, "pages=")) {
-                pages[caller] += numberOf(word).value_or(0);
+                uint64_t& sum = pages[caller];
+                sum = MWSaturatingAdd(sum, numberOf(word).value_or(0));
                 break;
             }
         }

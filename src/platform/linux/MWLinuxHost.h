@@ -74,6 +74,8 @@ public:
     kern_return_t mach_memory_info(MWKernelMemoryArrays& arrays) override;
     /// KERN_INVALID_ARGUMENT for what is no array, whole, from here.
     kern_return_t vm_deallocate(const void* address, size_t size) override;
+    /// Those that the last answer about the kernel's memory has records of: load tags are places in a list
+    /// that changes.
     std::vector<MWKernelExtension> loadedKernelExtensions() override;
     std::unique_ptr<KernelSymbolicator> makeKernelSymbolicator() override;
 
@@ -127,6 +129,7 @@ private:
     };
     std::mutex _kernelMutex;  ///< guards what follows
     std::map<const void*, KernelArray> _kernelArrays;
-    /// Of the last answer about the kernel's memory, for the symbolicator that is made next.
+    // Of the last answer about the kernel's memory.
+    std::vector<MWKernelExtension> _kernelModules;
     std::shared_ptr<const KernelSourceLocations> _kernelSourceLocations;
 };

@@ -30,6 +30,7 @@ kern_return_t MWLinuxHost::mach_memory_info(MWKernelMemoryArrays& arrays) {
               .records = _handOver(memory->records)};
     const std::lock_guard lock(_kernelMutex);
     _kernelSourceLocations = std::move(memory->locations);
+    _kernelModules = std::move(memory->modules);
     return KERN_SUCCESS;
 }
 
@@ -47,7 +48,8 @@ kern_return_t MWLinuxHost::vm_deallocate(const void* address, size_t size) {
 }
 
 std::vector<MWKernelExtension> MWLinuxHost::loadedKernelExtensions() {
-    return readKernelModules(_run.proc.get());
+    const std::lock_guard lock(_kernelMutex);
+    return _kernelModules;
 }
 
 std::unique_ptr<KernelSymbolicator> MWLinuxHost::makeKernelSymbolicator() {
