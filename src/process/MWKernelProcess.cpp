@@ -10,9 +10,9 @@
 #include <utility>
 
 #include "platform/MWKernelTags.h"
+#include "platform/MWSizeMath.h"
 #include "platform/MWTerminalText.h"
 #include "platform/MWUTF8.h"
-#include "platform/MWSizeMath.h"
 
 namespace {
 

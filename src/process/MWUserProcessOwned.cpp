@@ -17,15 +17,16 @@ MWAuxDatum bytesOfOneProcess(uint64_t bytes) {
 }
 
 /// None when the reply is shorter than it says.
-std::optional<MWOwnedObjects> ownedObjectsOfReply(std::span<const std::byte> reply) {
+/// A reply that is shorter than it says, which no kernel gives, lists nothing.
+MWOwnedObjects ownedObjectsOfReply(std::span<const std::byte> reply) {
     uint64_t count = 0;
     if (reply.size() < sizeof(count)) {
-        return std::nullopt;
+        return {};
     }
     std::memcpy(&count, reply.data(), sizeof(count));
     reply = reply.subspan(sizeof(count));
     if (count > reply.size() / sizeof(OwnedObjectRecord)) {
-        return std::nullopt;
+        return {};
     }
     MWOwnedObjects objects;
     for (; count != 0; --count) {
@@ -123,8 +124,5 @@ std::optional<MWOwnedObjects> MWUserProcess::_gatherOwnedVmObjects() {
         return std::nullopt;
     }
     const auto reply = _fetchOwnedVmObjects();
-    if (!reply) {
-        return std::nullopt;
-    }
-    return reply->empty() ? MWOwnedObjects() : ownedObjectsOfReply(*reply);
+    return reply ? std::optional(ownedObjectsOfReply(*reply)) : std::nullopt;
 }

@@ -100,6 +100,11 @@ TEST(Fdinfo, BuffersAndMapsOfOtherKinds) {
     ASSERT_TRUE(heap);
     EXPECT_FALSE(heap->fromVideoDevice);
     EXPECT_FALSE(procfs::parseDmaBuffer("count:\t1\nexp_name:\tsystem\n"));
+    const auto forged = procfs::parseDmaBuffer(
+        "size:\t4096\ncount:\t1\nexp_name:\tsystem\nname:\ta\nsize:\t18446744073709551615\nexp_name:\tvb2\n");
+    ASSERT_TRUE(forged);
+    EXPECT_EQ(forged->size, 4096U) << "whatever a process calls its buffer";
+    EXPECT_FALSE(forged->fromVideoDevice);
 
     const auto map = procfs::parseBpfMap(
         "pos:\t0\nmap_type:\t2\nkey_size:\t4\nmax_entries:\t1024\nmemlock:\t8576\nmap_id:\t17\nfrozen:\t0\n");
@@ -149,6 +154,15 @@ TEST(MemoryMounts, TheInnermostMountDecides) {
     EXPECT_FALSE(mounts.hold("/etc/passwd"));
     EXPECT_FALSE(MemoryMounts("").hold("/dev/shm/x"));
     EXPECT_TRUE(MemoryMounts("20 1 0:2 / / rw - tmpfs rootfs rw\n").hold("/x"));
+    EXPECT_EQ(mounts.ofDevice(34), MemoryFileSystem::shmem);
+    EXPECT_EQ(mounts.ofDevice(37), MemoryFileSystem::hugetlb);
+    EXPECT_EQ(mounts.ofDevice(uint64_t{254} << 32U), MemoryFileSystem::none);
+    EXPECT_EQ(mounts.ofDevice(99), MemoryFileSystem::none);
+    const MemoryMounts jail("20 1 0:34 / /dev rw - devtmpfs dev rw\n21 1 254:0 / / rw - ext4 x rw\n",
+                            "/srv/jail");
+    EXPECT_TRUE(jail.hold("/srv/jail/dev/x"));
+    EXPECT_FALSE(jail.hold("/srv/jail/x"));
+    EXPECT_FALSE(jail.hold("/dev/x")) << "outside of the root that the mounts are seen from";
 }
 
 }  // namespace

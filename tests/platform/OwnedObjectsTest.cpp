@@ -1,14 +1,21 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <sys/mman.h>
 #include <sys/shm.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
+#include <csignal>
 #include <cstring>
+#include <fstream>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/linux/MWLinuxHost.h"
@@ -127,20 +134,22 @@ TEST(OwnedObjects, TheOldestHolderIsChargedUnlessOneOfThemMapsTheObject) {
     const int held = memoryFile(kMiB);
     const int mapped = memoryFile(2 * kMiB);
     const int watched = memoryFile(4 * kMiB);
+    const int untouched = memoryFile(8 * kMiB);
     // Whichever is younger by the clock that the kernel tells (hundredths of a second) or, then, by pid.
     const ChildProcess first([&] { return 0; });
     const ChildProcess second([&] {
         mapAndTouch(mapped, 2 * kMiB);
+        mmap(nullptr, 8 * kMiB, PROT_READ, MAP_SHARED, untouched, 0);
         return 0;
     });
     const ChildProcess mapper([&] {
         mapAndTouch(watched, 4 * kMiB);
-        for (const int file : {held, mapped, watched}) {
+        for (const int file : {held, mapped, watched, untouched}) {
             close(file);
         }
         return 0;
     });
-    for (const int file : {held, mapped, watched}) {
+    for (const int file : {held, mapped, watched, untouched}) {
         close(file);
     }
     MWLinuxHost host;
@@ -148,11 +157,11 @@ TEST(OwnedObjects, TheOldestHolderIsChargedUnlessOneOfThemMapsTheObject) {
     EXPECT_EQ(totalOf(all.objectsOf(0)), 0U);
     EXPECT_EQ(totalOf(all.objectsOf(1)), 0U);
     const auto charged = all.objectsOf(2);
-    EXPECT_EQ(totalOf(charged), 5 * kMiB)
-        << "the held one, and the one that only a process maps which holds it not";
+    EXPECT_EQ(totalOf(charged), 13 * kMiB)
+        << "what nobody maps or only one who holds it not, and what a younger one maps and shows nothing of";
 
     Measured alone(host, {first.pid()});
-    EXPECT_EQ(totalOf(alone.objectsOf(0)), 7 * kMiB) << "others are not looked at";
+    EXPECT_EQ(totalOf(alone.objectsOf(0)), 15 * kMiB) << "others are not looked at";
 }
 
 TEST(OwnedObjects, ASysVSegmentIsItsCreatorsWhileNobodyHasItAttached) {
@@ -180,23 +189,79 @@ TEST(OwnedObjects, ASysVSegmentIsItsCreatorsWhileNobodyHasItAttached) {
     shmctl(segment, IPC_RMID, nullptr);
 }
 
-TEST(OwnedObjects, SocketBuffersAreOneObject) {
-    const ChildProcess process([] {
+// Two processes hold the sockets: the second is a fork of the first.
+TEST(OwnedObjects, SocketBuffersAreOneObjectOfOneProcess) {
+    int ends[2][2] = {};
+    for (auto& pair : ends) {
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
         const std::string data(50000, 'x');
-        for (int pair = 0; pair < 2; ++pair) {
-            int ends[2] = {-1, -1};
-            if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) == 0) {
-                write(ends[0], data.data(), data.size());
-            }
-        }
+        ASSERT_EQ(write(pair[0], data.data(), data.size()), 50000);
+    }
+    const ChildProcess first;
+    // A socket stays where it was made.
+    const ChildProcess second([] {
+        unshare(CLONE_NEWNET);
         return 0;
     });
+    for (auto& pair : ends) {
+        close(pair[0]);
+        close(pair[1]);
+    }
     MWLinuxHost host;
-    Measured measured(host, {process.pid()});
-    const auto objects = measured.objectsOf(0);
+    Measured both(host, {first.pid(), second.pid()});
+    const auto objects = both.objectsOf(0);
     ASSERT_EQ(objects.size(), 1U);
     EXPECT_EQ(objects[0].ledgerTag(), MWLedgerNetwork);
     EXPECT_GE(objects[0].resident, 100000U);
+    EXPECT_TRUE(both.objectsOf(1).empty());
+    Measured alone(host, {second.pid()});
+    EXPECT_EQ(totalOf(alone.objectsOf(0)), objects[0].resident);
+}
+
+TEST(OwnedObjects, AProcessWithoutItsFirstThreadIsLookedAtThroughAnother) {
+    const int mapped = memoryFile(2 * kMiB);
+    const ChildProcess older;
+    const pid_t younger = fork();
+    if (younger == 0) {
+        std::thread([&] {
+            mapAndTouch(mapped, 2 * kMiB);
+            pause();
+        }).detach();
+        syscall(SYS_exit, 0);
+    }
+    close(mapped);
+    const std::string stat = "/proc/" + std::to_string(younger) + "/stat";
+    const auto isZombie = [&] {
+        std::string text;
+        std::getline(std::ifstream(stat), text);
+        return text.find(") Z ") != std::string::npos;
+    };
+    MWLinuxHost host;
+    const auto showsMapping = [&] {
+        task_t task = 0;
+        rusage_info_v5 usage;
+        const bool shows = isZombie() && host.task_read_for_pid(younger, task) == KERN_SUCCESS &&
+                           host.proc_pid_rusage(younger, usage) == 0 && usage.ri_phys_memweight >= 2 * kMiB;
+        host.task_release(task);
+        return shows;
+    };
+    while (!showsMapping()) {
+        sched_yield();
+    }
+    {
+        Measured both(host, {older.pid(), younger});
+        EXPECT_EQ(totalOf(both.objectsOf(0)), 0U) << "the younger one maps it";
+        std::array<ledger_entry_info, 1> ledgers = {};
+        size_t filled = 0;
+        EXPECT_EQ(host.ledgerEntries(younger, ledgers, filled), 0);
+        EXPECT_GT(ledgers[0].lei_balance, 0);
+    }
+    kill(younger, SIGKILL);
+    siginfo_t ended = {};
+    waitid(P_PID, static_cast<id_t>(younger), &ended, WEXITED | WNOWAIT);
+    rusage_info_v5 usage;
+    EXPECT_EQ(host.proc_pid_rusage(younger, usage), -1) << "there is nothing to charge any more";
+    waitpid(younger, nullptr, 0);
 }
 
 class RecordedDescriptors : public RecordedTree {

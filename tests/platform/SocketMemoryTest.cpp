@@ -97,21 +97,6 @@ TEST(SocketMessages, WhatWaitsIsCountedAndNotWhatIsAllowed) {
         << "a listener's count is one of connections";
 }
 
-TEST(SocketMessages, RingsOfPacketSockets) {
-    Message attributes;
-    appendAttribute(attributes, PACKET_DIAG_RX_RING,
-                    packet_diag_ring{.pdr_block_size = 1U << 20U,
-                                     .pdr_block_nr = 1U << 13U,
-                                     .pdr_frame_size = 0,
-                                     .pdr_frame_nr = 0,
-                                     .pdr_retire_tmo = 0,
-                                     .pdr_sizeof_priv = 0,
-                                     .pdr_features = 0});
-    packet_diag_msg body = {};
-    body.pdiag_ino = 5;
-    EXPECT_EQ(bytesOf(message(body, attributes), Family::packet, 5), uint64_t{1} << 33U);
-}
-
 TEST(SocketMessages, TheListEndsWithAMessageOfItsOwn) {
     Message part = internetSocket(7);
     append(part, nlmsghdr{sizeof(nlmsghdr), NLMSG_DONE, 0, 0, 0});
@@ -152,7 +137,11 @@ uint64_t bytesOfDescriptor(pid_t pid, int socket) {
     const procfs::Descriptor descriptors = procfs::open(process.get(), "fd", O_DIRECTORY);
     struct stat status = {};
     EXPECT_EQ(fstatat(descriptors.get(), number.c_str(), &status, 0), 0);
-    return SocketMemory(process.get()).bytesOf(status.st_ino, descriptors.get(), number.c_str());
+    const auto sockets =
+        SocketMemory::ofNamespace(procfs::readNamespace(process.get(), "net"), process.get());
+    return sockets == nullptr
+               ? 0
+               : sockets->bytesOf(status.st_ino, descriptors.get(), number.c_str()).value_or(0);
 }
 
 uint64_t liveBytes(const procfs::Descriptor& socket) {
@@ -229,8 +218,7 @@ TEST(SocketMemory, AnotherNamespaceIsEntered) {
     });
     ASSERT_NE(process.answer(), 0U);
     EXPECT_GT(bytesOfDescriptor(process.pid(), static_cast<int>(process.answer())), 10000U);
-    const procfs::Descriptor own = procfs::open(AT_FDCWD, "/proc/self/fd", O_DIRECTORY);
-    EXPECT_EQ(SocketMemory(-1).bytesOf(4711, own.get(), "0"), 0U) << "a namespace that cannot be entered";
+    EXPECT_EQ(SocketMemory::ofNamespace(1, -1), nullptr) << "a namespace that cannot be entered";
 }
 
 }  // namespace

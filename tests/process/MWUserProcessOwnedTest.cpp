@@ -152,7 +152,7 @@ TEST_F(OwnedByProcess, NothingOwnedAndNothingToldAreDifferent) {
     EXPECT_TRUE(_host.ownedFetches.empty());
     own(2);
     _host.ownedReplyIsCut = true;
-    EXPECT_FALSE(ask()) << "a reply shorter than it says";
+    EXPECT_TRUE(ask() && ask()->empty()) << "a reply shorter than it says";
     EXPECT_TRUE(_process->warnings().empty());
     process().ownedError = ENOENT;
     EXPECT_FALSE(ask());

@@ -126,6 +126,9 @@ std::optional<DmaBuffer> parseDmaBuffer(std::string_view fdinfo) {
     std::optional<uint64_t> size;
     bool fromVideoDevice = false;
     for (Line line; takeKeyedLine(fdinfo, line);) {
+        if (line.key == "name") {
+            break;  // the process's own text, which can hold further lines
+        }
         if (line.key == "size") {
             size = bytesOf(line.value);
         } else if (line.key == "exp_name") {

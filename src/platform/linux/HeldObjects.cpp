@@ -1,9 +1,7 @@
 #include "platform/linux/HeldObjects.h"
 
 #include <fcntl.h>
-#include <linux/magic.h>
 #include <sys/stat.h>
-#include <sys/statfs.h>
 #include <sys/syscall.h>
 #include <sys/sysinfo.h>
 #include <unistd.h>
@@ -103,8 +101,9 @@ private:
                                                       .directory = directory,
                                                       .descriptor = number});
         if (bytes != 0) {
-            _add(_scan.identity.unmapped(ObjectIdentity::Unmapped::socket, *_networkNamespace, inode),
-                 MWLedgerNetwork, {.virtual_size = bytes, .resident = bytes});
+            // Sockets of all namespaces are numbered in one row.
+            _add(_scan.identity.unmapped(ObjectIdentity::Unmapped::socket, inode, 0), MWLedgerNetwork,
+                 {.virtual_size = bytes, .resident = bytes});
         }
     }
 
@@ -144,15 +143,15 @@ private:
         OwnedObjectRecord record = {.virtual_size = std::max<uint64_t>(file->stx_size, bytes),
                                     .resident = bytes};
         const uint64_t device = _deviceOf(*file);
-        switch (_scan.targets.fileSystemOf(device, directory, number)) {
-            case DescriptorTargets::FileSystem::shmem:
+        switch (_scan.targets.fileSystemOf(device, _mounts())) {
+            case MemoryFileSystem::shmem:
                 record.compressed = std::min(bytes, swappedBytes(directory, number, _scan.pageSize));
                 record.resident -= record.compressed;
                 break;
-            case DescriptorTargets::FileSystem::hugetlb:
+            case MemoryFileSystem::hugetlb:
                 record.wired = bytes;
                 break;
-            case DescriptorTargets::FileSystem::other:
+            case MemoryFileSystem::none:
                 return;
         }
         HeldObject& object = _add(_scan.identity.file(device, file->stx_ino), MWLedgerDefault, record);
@@ -183,7 +182,7 @@ private:
 
     const MemoryMounts& _mounts() {
         if (_knownMounts == nullptr) {
-            _knownMounts = &_scan.targets.mountsOf(_process);
+            _knownMounts = _scan.targets.mountsOf(_process);
         }
         return *_knownMounts;
     }
@@ -193,50 +192,68 @@ private:
     HeldObjects _objects;
     std::string _target;
     std::string _text;
-    const MemoryMounts* _knownMounts = nullptr;
+    std::shared_ptr<const MemoryMounts> _knownMounts;
     std::optional<uint64_t> _networkNamespace;
 };
 
 }  // namespace
 
-const MemoryMounts& DescriptorTargets::mountsOf(int processDirectory) {
+// What a process that is about to end tells, or does not, is no answer for the others of its namespace.
+std::shared_ptr<const MemoryMounts> DescriptorTargets::mountsOf(int processDirectory) {
     constexpr size_t kLongestMountinfo = 64U << 20U;
     std::string root;
     procfs::readLink(processDirectory, "root", root);
-    const std::lock_guard lock(_mutex);
-    auto& mounts = _mounts[{procfs::readNamespace(processDirectory, "mnt"), std::move(root)}];
-    if (mounts == nullptr) {
-        std::string text;
-        procfs::readFile(processDirectory, "mountinfo", text, kLongestMountinfo);
-        mounts = std::make_unique<const MemoryMounts>(text);
-    }
-    return *mounts;
-}
-
-uint64_t DescriptorTargets::bytesOf(const Socket& socket) {
-    const std::lock_guard lock(_mutex);
-    auto& sockets = _sockets[socket.networkNamespace];
-    if (sockets == nullptr) {
-        sockets = std::make_unique<SocketMemory>(socket.processDirectory);
-    }
-    return sockets->bytesOf(socket.inode, socket.directory, socket.descriptor);
-}
-
-DescriptorTargets::FileSystem DescriptorTargets::fileSystemOf(uint64_t device, int directory,
-                                                              const char* path) {
-    const std::lock_guard lock(_mutex);
-    const auto [known, isNew] = _fileSystems.try_emplace(device, FileSystem::other);
-    if (isNew) {
-        const procfs::Descriptor file = procfs::open(directory, path, O_PATH);
-        struct statfs status = {};
-        if (file && fstatfs(file.get(), &status) == 0) {
-            const bool isHugetlb = status.f_type == HUGETLBFS_MAGIC;
-            known->second = status.f_type == TMPFS_MAGIC
-                                ? FileSystem::shmem
-                                : (isHugetlb ? FileSystem::hugetlb : FileSystem::other);
+    const std::pair key(procfs::readNamespace(processDirectory, "mnt"), root);
+    {
+        const std::lock_guard lock(_mutex);
+        if (const auto known = _mounts.find(key); known != _mounts.end()) {
+            return known->second;
         }
     }
-    return known->second;
+    std::string text;
+    const bool isWhole = procfs::readFile(processDirectory, "mountinfo", text, kLongestMountinfo);
+    auto mounts = std::make_shared<const MemoryMounts>(text, root);
+    if (isWhole && !text.empty() && key.first != 0) {
+        const std::lock_guard lock(_mutex);
+        _mounts.emplace(key, mounts);
+    }
+    return mounts;
+}
+
+SocketMemory* DescriptorTargets::_socketsOf(uint64_t networkNamespace, int processDirectory) {
+    auto& sockets = _sockets[networkNamespace];
+    if (sockets == nullptr) {
+        sockets = SocketMemory::ofNamespace(networkNamespace, processDirectory);
+    }
+    return sockets.get();
+}
+
+// A socket stays in the namespace in which it was made, whichever one its process goes to.
+uint64_t DescriptorTargets::bytesOf(const Socket& socket) {
+    const std::lock_guard lock(_mutex);
+    SocketMemory* own = _socketsOf(socket.networkNamespace, socket.processDirectory);
+    if (own != nullptr) {
+        if (const auto bytes = own->bytesOf(socket.inode, socket.directory, socket.descriptor)) {
+            return *bytes;
+        }
+    }
+    const procfs::Descriptor self = procfs::open(AT_FDCWD, "/proc/thread-self", O_PATH);
+    _socketsOf(procfs::readNamespace(self.get(), "net"), self.get());
+    for (const auto& [number, other] : _sockets) {
+        if (other != nullptr && other.get() != own) {
+            if (const auto bytes = other->bytesOf(socket.inode, socket.directory, socket.descriptor)) {
+                return *bytes;
+            }
+        }
+    }
+    return 0;
+}
+
+MemoryFileSystem DescriptorTargets::fileSystemOf(uint64_t device, const MemoryMounts& mounts) const {
+    if (device == _devices.internalDevice()) {
+        return MemoryFileSystem::shmem;
+    }
+    return _devices.isInternalHugetlb(device) ? MemoryFileSystem::hugetlb : mounts.ofDevice(device);
 }
 
 HeldObjects heldObjects(int processDirectory, const DescriptorScan& scan) {

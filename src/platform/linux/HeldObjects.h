@@ -12,6 +12,7 @@
 #include "platform/MWHostRecords.h"
 #include "platform/linux/MemoryMounts.h"
 #include "platform/linux/ObjectIdentity.h"
+#include "platform/linux/ShmemDevices.h"
 #include "platform/linux/SocketMemory.h"
 
 /// A kernel object that a process holds through a descriptor. A socket's record has its bytes alone: sockets
@@ -33,10 +34,10 @@ using HeldObjects = std::unordered_map<uint64_t, HeldObject>;
 /// from several threads.
 class DescriptorTargets {
 public:
-    enum class FileSystem : uint8_t { other, shmem, hugetlb };
+    explicit DescriptorTargets(const ShmemDevices& devices) : _devices(devices) {}
 
-    /// Of the mount namespace of the process with this directory, seen from its root.
-    const MemoryMounts& mountsOf(int processDirectory);
+    /// Of the mount namespace of the process with this directory, by the paths that its links have.
+    std::shared_ptr<const MemoryMounts> mountsOf(int processDirectory);
     struct Socket {
         uint64_t inode;
         uint64_t networkNamespace;  ///< in which the process is
@@ -46,15 +47,17 @@ public:
     };
     /// What the socket holds in the kernel.
     uint64_t bytesOf(const Socket& socket);
-    /// The file system with this device number; `path` leads to a file on it and is not opened for more than
-    /// the question.
-    FileSystem fileSystemOf(uint64_t device, int directory, const char* path);
+    /// The memory file system with this device number, mounted in `mounts` or internal to the kernel.
+    MemoryFileSystem fileSystemOf(uint64_t device, const MemoryMounts& mounts) const;
 
 private:
+    /// None where the namespace cannot be entered through this process; through another one it may be.
+    SocketMemory* _socketsOf(uint64_t networkNamespace, int processDirectory);
+
+    const ShmemDevices& _devices;
     std::mutex _mutex;
-    std::map<std::pair<uint64_t, std::string>, std::unique_ptr<const MemoryMounts>> _mounts;
+    std::map<std::pair<uint64_t, std::string>, std::shared_ptr<const MemoryMounts>> _mounts;
     std::map<uint64_t, std::unique_ptr<SocketMemory>> _sockets;  ///< by network namespace
-    std::map<uint64_t, FileSystem> _fileSystems;
 };
 
 struct DescriptorScan {

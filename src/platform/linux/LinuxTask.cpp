@@ -28,12 +28,26 @@ std::string bootId(int procDirectory) {
     return text;
 }
 
-struct LiveThread {
-    int32_t identifier = 0;
-    procfs::Descriptor directory;
-};
+// Whether the kernel lets the caller look at the memory. Of a process that has ended there is none to look
+// at, which is no refusal.
+bool mayLook(int memoryDirectory) {
+    return static_cast<bool>(procfs::open(memoryDirectory, "maps")) || errno == ESRCH;
+}
 
-// A thread of the process that has not ended; without a directory when there is none left.
+}  // namespace
+
+LinuxRun::LinuxRun(const std::string& procDirectory)
+    : proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
+      pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
+      identity(bootId(proc.get())),
+      ownedObjects(
+          {.proc = proc.get(), .pageSize = pageSize, .shmemDevices = shmemDevices, .identity = identity}),
+      frames(procfs::open(proc.get(), "kpageflags")),
+      untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)) {}
+
+LinuxTask::LinuxTask(LinuxRun& run, int32_t pid)
+    : _run(run), _pid(pid), _directory(openDirectory(run.proc.get(), std::to_string(pid))), _threadId(pid) {}
+
 LiveThread openLiveThread(int processDirectory) {
     LiveThread found;
     procfs::forEachEntry(processDirectory, "task", [&](int threads, const char* name) {
@@ -47,28 +61,6 @@ LiveThread openLiveThread(int processDirectory) {
     return found;
 }
 
-// Whether the kernel lets the caller look at the memory. Of a process that has ended there is none to look
-// at, which is no refusal.
-bool mayLook(int memoryDirectory) {
-    return static_cast<bool>(procfs::open(memoryDirectory, "maps")) || errno == ESRCH;
-}
-
-}  // namespace
-
-LinuxRun::LinuxRun(const std::string& procDirectory)
-    : proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
-      pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
-      identity(bootId(proc.get())),
-      ownedObjects({.proc = proc.get(),
-                    .pageSize = pageSize,
-                    .shmemDevice = shmemDevices.internalDevice(),
-                    .identity = identity}),
-      frames(procfs::open(proc.get(), "kpageflags")),
-      untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)) {}
-
-LinuxTask::LinuxTask(LinuxRun& run, int32_t pid)
-    : _run(run), _pid(pid), _directory(openDirectory(run.proc.get(), std::to_string(pid))), _threadId(pid) {}
-
 bool hasLiveThread(int processDirectory) {
     return static_cast<bool>(openLiveThread(processDirectory).directory);
 }
@@ -81,7 +73,7 @@ std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
     }
     task->_startTime = stat->startTime;
     task->_chooseThread();
-    return mayLook(task->_memoryDirectory()) ? std::move(task) : nullptr;
+    return mayLook(task->memoryDirectory()) ? std::move(task) : nullptr;
 }
 
 LinuxTask::~LinuxTask() {
@@ -89,7 +81,7 @@ LinuxTask::~LinuxTask() {
 }
 
 bool LinuxTask::_chooseThread() {
-    const auto chosen = readStat(_memoryDirectory());
+    const auto chosen = readStat(memoryDirectory());
     if (chosen && !chosen->threadEnded()) {
         return true;
     }
@@ -107,12 +99,12 @@ kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t&
         if (!_chooseThread()) {
             return MACH_SEND_INVALID_DEST;
         }
-        const auto before = readStat(_memoryDirectory());
-        const bool read = procfs::readMappings(_memoryDirectory(), "smaps", vmas);
+        const auto before = readStat(memoryDirectory());
+        const bool read = procfs::readMappings(memoryDirectory(), "smaps", vmas);
         if (!read && errno != ESRCH) {
             return KERN_FAILURE;
         }
-        const auto after = readStat(_memoryDirectory());
+        const auto after = readStat(memoryDirectory());
         if (read && before && after && !after->threadEnded() && after->isSameProgramAs(*before)) {
             startStack = after->startStack;
             return vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
@@ -124,7 +116,7 @@ kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t&
 ForkFamily& LinuxTask::_family() {
     if (_forkFamily == nullptr) {
         _forkFamily = _run.families.family(
-            forkFamilyIdentifier(_run.proc.get(), _memoryDirectory(), _threadId, _run.identity));
+            forkFamilyIdentifier(_run.proc.get(), memoryDirectory(), _threadId, _run.identity));
     }
     return *_forkFamily;
 }
@@ -139,14 +131,13 @@ kern_return_t LinuxTask::takeSnapshot() {
     if (code != KERN_SUCCESS) {
         return code;
     }
-    _pages.emplace(_memoryDirectory(),
-                   PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
+    _pages.emplace(memoryDirectory(), PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
     const ProcessIdentity owner = _run.sharedSpaces.ownerOf(_candidate(startStack));
     _space.emplace(std::move(vmas),
                    AddressSpaceOwner{.pid = owner.pid,
                                      .startTime = owner.startTime,
-                                     .ipcNamespace = procfs::readNamespace(_memoryDirectory(), "ipc"),
-                                     .directory = _memoryDirectory(),
+                                     .ipcNamespace = procfs::readNamespace(memoryDirectory(), "ipc"),
+                                     .directory = memoryDirectory(),
                                      .family = [this]() -> ForkFamily& { return _family(); }},
                    *_pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
     if (owner.pid == _pid) {
@@ -174,12 +165,12 @@ void LinuxTask::_checkFamilyMemory() {
 }
 
 bool LinuxTask::sharesAnothersSpace() {
-    const auto stat = readStat(_memoryDirectory());
+    const auto stat = readStat(memoryDirectory());
     return stat && _run.sharedSpaces.ownerOf(_candidate(stat->startStack)).pid != _pid;
 }
 
 void LinuxTask::surveyOwnedObjects() {
-    _run.ownedObjects.add({_pid, _startTime}, _memoryDirectory());
+    _run.ownedObjects.add({_pid, _startTime}, memoryDirectory());
 }
 
 // An object is left to the region walk where that shows it. A mapping whose pages the process has not touched

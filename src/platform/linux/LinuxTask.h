@@ -36,6 +36,12 @@ struct LinuxRun {
     bool seesFrames() const { return untouchedPage.frame() != 0; }
 };
 
+struct LiveThread {
+    int32_t identifier = 0;
+    procfs::Descriptor directory;
+};
+/// A thread of the process that has not ended; without a directory when there is none left.
+LiveThread openLiveThread(int processDirectory);
 /// Whether a thread of the process lives, be it the first one or another.
 bool hasLiveThread(int processDirectory);
 
@@ -53,6 +59,8 @@ public:
     int32_t pid() const { return _pid; }
     /// /proc/PID, opened with O_PATH.
     int directory() const { return _directory.get(); }
+    /// The same, or /proc/PID/task/TID of a thread that lives where the first one has ended.
+    int memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
 
     /// Takes a snapshot unless there is one. MACH_SEND_INVALID_DEST when the process has ended,
     /// KERN_INVALID_ADDRESS when it lives and has no memory of its own, KERN_FAILURE when the kernel refuses.
@@ -79,7 +87,6 @@ private:
     LinuxTask(LinuxRun& run, int32_t pid);
 
     /// The directory to read memory through: that of a thread that lives.
-    int _memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
     /// False when no thread of the process lives.
     bool _chooseThread();
     kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack);

@@ -93,6 +93,16 @@ bool MWLinuxHost::_readProcessFile(int32_t pid, const char* name, std::string& t
     return read;
 }
 
+// Of a thread that lives: the first one can end before the others.
+std::optional<procfs::ProcStatus> MWLinuxHost::_memoryStatusOfPid(int32_t pid) {
+    procfs::Descriptor opened;
+    const LinuxTask* task = _taskOfPid(pid);
+    const int directory = task != nullptr ? task->memoryDirectory() : _processDirectory(pid, opened);
+    std::string text;
+    const bool read = directory >= 0 && procfs::readFile(directory, "status", text);
+    return read ? std::optional(procfs::parseStatus(text)) : std::nullopt;
+}
+
 std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
     std::string text;
     return _readProcessFile(pid, "stat", text) ? procfs::parseStat(text) : std::nullopt;
@@ -154,13 +164,12 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
 }
 
 int MWLinuxHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
-    std::string text;
-    if (!_readProcessFile(pid, "status", text)) {
-        return -1;
+    const auto status = _memoryStatusOfPid(pid);
+    if (!status || !status->hasMemory) {
+        return noSuchProcess();
     }
-    const procfs::ProcStatus status = procfs::parseStatus(text);
-    record.ri_phys_memweight = physicalCharge(status);
-    record.ri_lifetime_max_phys_memweight = std::max(record.ri_phys_memweight, status.vmHwm);
+    record.ri_phys_memweight = physicalCharge(*status);
+    record.ri_lifetime_max_phys_memweight = std::max(record.ri_phys_memweight, status->vmHwm);
     return 0;
 }
 
@@ -213,16 +222,16 @@ int MWLinuxHost::ledgerTemplate(std::span<ledger_template_info> records, size_t&
 
 // Page tables belong to an address space: of processes that share one, only its owner is charged for them.
 int MWLinuxHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) {
-    std::string text;
     filled = 0;
-    if (!_readProcessFile(pid, "status", text)) {
-        return -1;
+    const auto status = _memoryStatusOfPid(pid);
+    if (!status) {
+        return noSuchProcess();
     }
     if (!records.empty()) {
         LinuxTask* task = _taskOfPid(pid);
         const bool isCharged = task == nullptr || !task->sharesAnothersSpace();
         records.front() = {};
-        records.front().lei_balance = isCharged ? static_cast<int64_t>(procfs::parseStatus(text).vmPte) : 0;
+        records.front().lei_balance = isCharged ? static_cast<int64_t>(status->vmPte) : 0;
         filled = 1;
     }
     return 0;

@@ -1,13 +1,15 @@
 #include "platform/linux/MemoryMounts.h"
 
-#include <algorithm>
-
 #include "platform/linux/ShmemDevices.h"
 
 namespace {
 
-bool livesInMemory(std::string_view fileSystem) {
-    return fileSystem == "tmpfs" || fileSystem == "hugetlbfs";
+MemoryFileSystem kindOf(std::string_view fileSystem) {
+    if (fileSystem == "hugetlbfs") {
+        return MemoryFileSystem::hugetlb;
+    }
+    const bool isShmem = fileSystem == "tmpfs" || fileSystem == "devtmpfs" || fileSystem == "rootfs";
+    return isShmem ? MemoryFileSystem::shmem : MemoryFileSystem::none;
 }
 
 bool isDigit(char character, char last) {
@@ -30,27 +32,35 @@ std::string unescaped(std::string_view text) {
     return plain;
 }
 
-bool liesBelow(std::string_view path, std::string_view point) {
-    return path.starts_with(point) && (path.size() == point.size() || path[point.size()] == '/');
+std::string_view withoutLastSlash(std::string_view path) {
+    return path.substr(0, path.size() - (path.ends_with('/') ? 1 : 0));
 }
 
 }  // namespace
 
-MemoryMounts::MemoryMounts(std::string_view mountinfo) {
+// Of two mounts on one point the later one lies above.
+MemoryMounts::MemoryMounts(std::string_view mountinfo, std::string_view root) {
     for (const procfs::Mount& mount : procfs::parseMountinfo(mountinfo)) {
-        std::string point = unescaped(mount.point);
-        if (point.ends_with('/')) {
-            point.pop_back();
-        }
-        std::erase_if(_mounts, [&](const Mount& earlier) { return earlier.point == point; });
-        _mounts.push_back({std::move(point), livesInMemory(mount.fileSystem)});
+        const MemoryFileSystem kind = kindOf(mount.fileSystem);
+        const std::string point = std::string(withoutLastSlash(root)) + unescaped(mount.point);
+        _points.insert_or_assign(std::string(withoutLastSlash(point)), kind);
+        _devices.emplace(mount.device, kind);
     }
-    std::ranges::stable_sort(_mounts, std::ranges::greater(),
-                             [](const Mount& mount) { return mount.point.size(); });
 }
 
 bool MemoryMounts::hold(std::string_view path) const {
-    const auto innermost =
-        std::ranges::find_if(_mounts, [=](const Mount& mount) { return liesBelow(path, mount.point); });
-    return innermost != _mounts.end() && innermost->inMemory;
+    for (size_t end = path.size(); end != std::string_view::npos; end = path.rfind('/', end - 1)) {
+        if (const auto found = _points.find(std::string(path.substr(0, end))); found != _points.end()) {
+            return found->second != MemoryFileSystem::none;
+        }
+        if (end == 0) {
+            break;
+        }
+    }
+    return false;
+}
+
+MemoryFileSystem MemoryMounts::ofDevice(uint64_t device) const {
+    const auto found = _devices.find(device);
+    return found == _devices.end() ? MemoryFileSystem::none : found->second;
 }

@@ -7,6 +7,7 @@
 #include <ctime>
 #include <string>
 
+#include "platform/linux/LinuxTask.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
 #include "platform/linux/SmapsParser.h"
@@ -19,19 +20,31 @@ uint64_t secondsOf(clockid_t clock) {
     return static_cast<uint64_t>(time.tv_sec);
 }
 
-// A creator's pid can have been given to another process since, which is then younger than the segment.
+// A creator's pid can have been given to another process since, which is then younger than the segment. One
+// that seems older than the system was made before the clock was set.
 bool canHaveMade(const ProcessIdentity& process, const procfs::SysVSegment& segment) {
     constexpr uint64_t kRounding = 2;
     const auto ticksPerSecond = static_cast<uint64_t>(sysconf(_SC_CLK_TCK));
     const uint64_t booted = secondsOf(CLOCK_REALTIME) - secondsOf(CLOCK_BOOTTIME);
     return process.pid == segment.creator &&
-           booted + process.startTime / ticksPerSecond <= segment.changeTime + kRounding;
+           (booted + process.startTime / ticksPerSecond <= segment.changeTime + kRounding ||
+            segment.changeTime < booted);
 }
 
 bool isStill(const ProcessIdentity& process, int directory) {
     std::string text;
     const auto stat = procfs::readFile(directory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
     return stat && stat->startTime == process.startTime;
+}
+
+// Those of a thread that lives where the first one has ended.
+std::vector<procfs::Vma> mappingsOf(int processDirectory) {
+    std::vector<procfs::Vma> vmas;
+    procfs::readMappings(processDirectory, "smaps", vmas);
+    if (vmas.empty()) {
+        procfs::readMappings(openLiveThread(processDirectory).directory.get(), "smaps", vmas);
+    }
+    return vmas;
 }
 
 }  // namespace
@@ -41,7 +54,7 @@ void OwnedObjectSurvey::begin() {
     _holdersOfObject.clear();
     _holders.clear();
     _segments.reset();
-    _targets = std::make_unique<DescriptorTargets>();
+    _targets = std::make_unique<DescriptorTargets>(_system.shmemDevices);
 }
 
 void OwnedObjectSurvey::add(const ProcessIdentity& process, int directory) {
@@ -84,7 +97,8 @@ void OwnedObjectSurvey::_addSysVSegments(Holder& holder) {
             continue;
         }
         const OwnedObjectRecord record = {
-            .object_id = _system.identity.sysV(_system.shmemDevice, segment.identifier, _ipcNamespace),
+            .object_id = _system.identity.sysV(_system.shmemDevices.internalDevice(), segment.identifier,
+                                               _ipcNamespace),
             .virtual_size = segment.size,
             .resident = segment.resident,
             .compressed = segment.swapped,
@@ -100,10 +114,12 @@ bool OwnedObjectSurvey::_maps(Holder& holder, const HeldObject& object) const {
             procfs::open(_system.proc, std::to_string(holder.process.pid).c_str(), O_PATH | O_DIRECTORY);
         std::vector<procfs::Vma> vmas;
         if (directory && isStill(holder.process, directory.get())) {
-            procfs::readMappings(directory.get(), "maps", vmas);
+            vmas = mappingsOf(directory.get());
         }
         for (const procfs::Vma& vma : vmas) {
-            holder.mappedFiles->emplace(vma.device(), vma.inode);
+            if (vma.resident() + vma.swap != 0) {
+                holder.mappedFiles->emplace(vma.device(), vma.inode);
+            }
         }
     }
     return holder.mappedFiles->contains({object.device, object.inode});

@@ -22,15 +22,14 @@
 /// several threads.
 class OwnedObjectSurvey {
 public:
-    /// `proc` is the root of the procfs, `shmemDevice` the device number that SysV segments have.
     struct System {
         int proc;
         uint64_t pageSize;
-        uint64_t shmemDevice;
+        const ShmemDevices& shmemDevices;
         const ObjectIdentity& identity;
     };
     /// The system outlives the survey.
-    explicit OwnedObjectSurvey(const System& system) : _system(system) {}
+    explicit OwnedObjectSurvey(const System& system) : _system(system) { begin(); }
 
     /// Forgets what was found: what processes hold changes.
     void begin();
@@ -44,7 +43,8 @@ public:
     std::vector<OwnedObjectRecord> objectsOf(const ProcessIdentity& process, const IsMapped& isMapped);
 
 private:
-    using MappedFiles = std::set<std::pair<uint64_t, uint64_t>>;  ///< device and inode
+    /// Device and inode of those that the walk of a process shows, which it does not for untouched mappings.
+    using MappedFiles = std::set<std::pair<uint64_t, uint64_t>>;
     struct Holder {
         ProcessIdentity process;
         HeldObjects objects;
@@ -66,7 +66,8 @@ private:
     System _system;
 
     mutable std::mutex _mutex;  ///< guards what follows
-    std::unique_ptr<DescriptorTargets> _targets = std::make_unique<DescriptorTargets>();
+    /// Replaced when a survey begins, which nobody does during another one.
+    std::unique_ptr<DescriptorTargets> _targets;
     /// Of the tool's own IPC namespace.
     std::optional<std::vector<procfs::SysVSegment>> _segments;
     uint64_t _ipcNamespace = 0;

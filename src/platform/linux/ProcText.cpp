@@ -77,6 +77,7 @@ ProcStatus parseStatus(std::string_view text) {
         for (const auto& [name, value] : fields) {
             if (takePrefix(line, name)) {
                 *value = parseKilobytes(line).value_or(0);
+                status.hasMemory = true;
                 break;
             }
         }

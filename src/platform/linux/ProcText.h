@@ -41,6 +41,7 @@ struct ProcStatus {
     uint64_t vmPte = 0;
     uint64_t vmSwap = 0;  ///< without swapped shmem
     uint64_t hugetlbPages = 0;
+    bool hasMemory = false;  ///< what has ended, and kernel threads, have none and no such lines
 };
 
 /// None when the text is no `stat` line.

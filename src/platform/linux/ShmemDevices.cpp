@@ -1,5 +1,6 @@
 #include "platform/linux/ShmemDevices.h"
 
+#include <linux/memfd.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -38,13 +39,32 @@ std::vector<Mount> parseMountinfo(std::string_view text) {
 
 }  // namespace procfs
 
-// The internal mount has no entry anywhere, but every memfd lies on it.
-ShmemDevices::ShmemDevices() {
-    const procfs::Descriptor probe(memfd_create("memweight-probe", MFD_CLOEXEC));
+namespace {
+
+// Of a file that is made for the question; none where the kernel makes none of this kind.
+std::optional<uint64_t> deviceOfMemfd(unsigned flags) {
+    const procfs::Descriptor probe(memfd_create("memweight-probe", MFD_CLOEXEC | flags));
     struct stat status = {};
-    if (probe && fstat(probe.get(), &status) == 0) {
-        _internalDevice = (uint64_t{major(status.st_dev)} << 32U) | minor(status.st_dev);
+    if (!probe || fstat(probe.get(), &status) != 0) {
+        return std::nullopt;
+    }
+    return (uint64_t{major(status.st_dev)} << 32U) | minor(status.st_dev);
+}
+
+}  // namespace
+
+// The internal mounts have no entry anywhere, but every memfd lies on one.
+ShmemDevices::ShmemDevices() {
+    if (const auto device = deviceOfMemfd(0)) {
+        _internalDevice = *device;
         _isShmem[_internalDevice] = true;
+    }
+    constexpr unsigned kSmallestHugePage = 16;  // 64 KiB, as a power of 2
+    constexpr unsigned kLargestHugePage = 34;
+    for (unsigned size = kSmallestHugePage; size <= kLargestHugePage; ++size) {
+        if (const auto device = deviceOfMemfd(MFD_HUGETLB | (size << MFD_HUGE_SHIFT))) {
+            _internalHugetlb.insert(*device);
+        }
     }
 }
 
@@ -70,7 +90,8 @@ bool ShmemDevices::isShmem(uint64_t device, int processDirectory) {
         procfs::readFile(processDirectory, "mountinfo", text, kLongestMountinfo) && !text.empty();
     const std::lock_guard lock(_mutex);
     for (const procfs::Mount& mount : procfs::parseMountinfo(text)) {
-        _isShmem.emplace(mount.device, mount.fileSystem == "tmpfs" || mount.fileSystem == "ramfs");
+        _isShmem.emplace(mount.device, mount.fileSystem == "tmpfs" || mount.fileSystem == "devtmpfs" ||
+                                           mount.fileSystem == "ramfs");
     }
     if (const auto found = _isShmem.find(device); found != _isShmem.end()) {
         return found->second;

@@ -31,6 +31,8 @@ public:
 
     /// The kernel's internal mount, on which SysV segments lie; 0 when it is not known.
     uint64_t internalDevice() const { return _internalDevice; }
+    /// Whether it is one of the kernel's internal mounts for huge pages, of which each size has one.
+    bool isInternalHugetlb(uint64_t device) const { return _internalHugetlb.contains(device); }
     /// `processDirectory` is where an unknown device is looked up (`mountinfo`). A device that is mounted
     /// nowhere there (the layers of an overlay, for one) counts as a disk, for the processes of that mount
     /// namespace only: what one process cannot see another may have mounted.
@@ -40,6 +42,7 @@ private:
     std::optional<bool> _known(uint64_t device, uint64_t mountNamespace);
 
     uint64_t _internalDevice = 0;
+    std::set<uint64_t> _internalHugetlb;
     std::mutex _mutex;
     std::unordered_map<uint64_t, bool> _isShmem;
     std::set<std::pair<uint64_t, uint64_t>> _notMounted;  ///< mount namespace and device

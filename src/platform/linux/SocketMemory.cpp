@@ -51,13 +51,11 @@ struct Attributes {
     std::array<uint32_t, SK_MEMINFO_VARS> memory = {};
     uint64_t unread = 0;  ///< of a local socket
     bool peerIsGone = false;
-    uint64_t rings =
-        0;  ///< of a packet socket; to its process they are clean pages of a mapping, if anything
 
     uint64_t bytes(Family family) const {
         const size_t written = family == Family::tcp ? SK_MEMINFO_WMEM_QUEUED : SK_MEMINFO_WMEM_ALLOC;
         return uint64_t{memory[SK_MEMINFO_RMEM_ALLOC]} + memory[written] + memory[SK_MEMINFO_OPTMEM] +
-               memory[SK_MEMINFO_BACKLOG] + (peerIsGone ? unread : 0) + rings;
+               memory[SK_MEMINFO_BACKLOG] + (peerIsGone ? unread : 0);
     }
 };
 
@@ -71,27 +69,16 @@ void readLocal(uint16_t type, Bytes value, Attributes& attributes) {
     }
 }
 
-void readPacket(uint16_t type, Bytes value, Attributes& attributes) {
-    if (type == PACKET_DIAG_MEMINFO) {
-        attributes.memory = readAs<decltype(attributes.memory)>(value);
-    } else if (type == PACKET_DIAG_RX_RING || type == PACKET_DIAG_TX_RING) {
-        const auto ring = readAs<packet_diag_ring>(value);
-        attributes.rings += uint64_t{ring.pdr_block_size} * ring.pdr_block_nr;
-    }
-}
-
 uint16_t memoryAttribute(Family family) {
     if (family == Family::netlink) {
         return NETLINK_DIAG_MEMINFO;
     }
-    return INET_DIAG_SKMEMINFO;
+    return family == Family::packet ? uint16_t{PACKET_DIAG_MEMINFO} : uint16_t{INET_DIAG_SKMEMINFO};
 }
 
 void readAttribute(Family family, uint16_t type, Bytes value, Attributes& attributes) {
     if (family == Family::local) {
         readLocal(type, value, attributes);
-    } else if (family == Family::packet) {
-        readPacket(type, value, attributes);
     } else if (type == memoryAttribute(family)) {
         attributes.memory = readAs<decltype(attributes.memory)>(value);
     }
@@ -137,11 +124,12 @@ Socket readSocket(Family family, Bytes bytes) {
     return {};
 }
 
-// Connections that nobody has accepted yet and sockets that nobody holds any more have no inode.
+// Connections that nobody has accepted yet and sockets that nobody holds any more have no inode. One that
+// goes several ways at once stands there once for each.
 void addSocket(Family family, Bytes message, SocketBytes& bytes) {
     const Socket socket = readSocket(family, message);
     if (socket.inode != 0) {
-        bytes[socket.inode] = readAttributes(family, socket.attributes).bytes(family);
+        bytes[socket.inode] += readAttributes(family, socket.attributes).bytes(family);
     }
 }
 
@@ -169,25 +157,33 @@ namespace {
 
 using sockdiag::Family;
 
-/// Asks a connection to the kernel's lists for one of them.
+/// Asks a connection to the kernel's lists for one of them. The rings of packet sockets are left out: their
+/// processes map them.
 class SocketList {
 public:
     SocketList(int connection, SocketBytes& bytes)
         : _connection(connection), _bytes(bytes), _buffer(kLargestPart) {}
 
-    void read(Family family) {
+    /// False when an answer was broken off.
+    bool read(Family family) {
         switch (family) {
             case Family::tcp:
-                return _readStreams();
+                _readStreams();
+                break;
             case Family::datagram:
-                return _readDatagrams();
+                _readDatagrams();
+                break;
             case Family::local:
-                return _readLocal();
+                _readLocal();
+                break;
             case Family::netlink:
-                return _readNetlink();
+                _readNetlink();
+                break;
             case Family::packet:
-                return _readPacket();
+                _readPacket();
+                break;
         }
+        return !_isBroken;
     }
 
 private:
@@ -208,7 +204,8 @@ private:
         request.idiag_ext = kMemory;
         request.idiag_states = UINT32_MAX;
         for (const uint8_t addressFamily : {uint8_t{AF_INET}, uint8_t{AF_INET6}}) {
-            for (const uint8_t protocol : {uint8_t{IPPROTO_UDP}, uint8_t{IPPROTO_RAW}}) {
+            for (const uint8_t protocol :
+                 {uint8_t{IPPROTO_UDP}, uint8_t{IPPROTO_UDPLITE}, uint8_t{IPPROTO_RAW}}) {
                 request.sdiag_family = addressFamily;
                 request.sdiag_protocol = protocol;
                 _read(Family::datagram, request);
@@ -235,7 +232,7 @@ private:
     void _readPacket() {
         packet_diag_req request = {};
         request.sdiag_family = AF_PACKET;
-        request.pdiag_show = PACKET_SHOW_MEMINFO | PACKET_SHOW_RING_CFG;
+        request.pdiag_show = PACKET_SHOW_MEMINFO;
         _read(Family::packet, request);
     }
 
@@ -262,6 +259,7 @@ private:
         do {
             count = recv(_connection, _buffer.data(), _buffer.size(), 0);
         } while (count < 0 && errno == EINTR);
+        _isBroken = _isBroken || count <= 0;
         return count > 0 &&
                sockdiag::readPart(std::span(_buffer).first(static_cast<size_t>(count)), family, _bytes);
     }
@@ -269,6 +267,7 @@ private:
     int _connection;
     SocketBytes& _bytes;
     std::vector<std::byte> _buffer;
+    bool _isBroken = false;
 };
 
 /// In which lists a socket can stand, by the name of its protocol; all where the kernel does not tell it.
@@ -283,10 +282,10 @@ std::vector<Family> familiesOf(int directory, const char* descriptor) {
         std::string_view name;
         Family family;
     };
-    constexpr Protocol kProtocols[] = {{"TCP", Family::tcp},       {"UNIX", Family::local},
-                                       {"UDP", Family::datagram},  {"RAW", Family::datagram},
-                                       {"PING", Family::datagram}, {"NETLINK", Family::netlink},
-                                       {"PACKET", Family::packet}};
+    constexpr Protocol kProtocols[] = {{"TCP", Family::tcp},         {"MPTCP", Family::tcp},
+                                       {"UNIX", Family::local},      {"UDP", Family::datagram},
+                                       {"RAW", Family::datagram},    {"PING", Family::datagram},
+                                       {"NETLINK", Family::netlink}, {"PACKET", Family::packet}};
     const std::string_view name = buffer.data();
     const auto* protocol = std::ranges::find_if(
         kProtocols, [=](const Protocol& candidate) { return name.starts_with(candidate.name); });
@@ -316,10 +315,9 @@ procfs::Descriptor connectIn(const procfs::Descriptor& networkNamespace) {
     return connection;
 }
 
-procfs::Descriptor connectToNamespaceOf(int processDirectory) {
-    const uint64_t wanted = procfs::readNamespace(processDirectory, "net");
+procfs::Descriptor connectTo(uint64_t number, int processDirectory) {
     const procfs::Descriptor self = procfs::open(AT_FDCWD, "/proc/thread-self", O_PATH);
-    if (wanted != 0 && wanted == procfs::readNamespace(self.get(), "net")) {
+    if (number != 0 && number == procfs::readNamespace(self.get(), "net")) {
         return connectHere();
     }
     const procfs::Descriptor networkNamespace = procfs::open(processDirectory, "ns/net");
@@ -328,20 +326,27 @@ procfs::Descriptor connectToNamespaceOf(int processDirectory) {
 
 }  // namespace
 
-SocketMemory::SocketMemory(int processDirectory) : _connection(connectToNamespaceOf(processDirectory)) {}
+std::unique_ptr<SocketMemory> SocketMemory::ofNamespace(uint64_t number, int processDirectory) {
+    procfs::Descriptor connection = connectTo(number, processDirectory);
+    if (!connection) {
+        return nullptr;
+    }
+    return std::unique_ptr<SocketMemory>(new SocketMemory(std::move(connection)));
+}
 
+// After an answer that was broken off, what comes next would be taken for the answer to the next question.
 void SocketMemory::_list(Family family) {
-    if (_listed.insert(family).second && _connection) {
-        SocketList(_connection.get(), _bytes).read(family);
+    if (_listed.insert(family).second && _connection && !SocketList(_connection.get(), _bytes).read(family)) {
+        _connection.reset();
     }
 }
 
-uint64_t SocketMemory::bytesOf(uint64_t inode, int directory, const char* descriptor) {
+std::optional<uint64_t> SocketMemory::bytesOf(uint64_t inode, int directory, const char* descriptor) {
     if (_listed.size() < sockdiag::kFamilies.size() && !_bytes.contains(inode)) {
         for (const Family family : familiesOf(directory, descriptor)) {
             _list(family);
         }
     }
     const auto found = _bytes.find(inode);
-    return found == _bytes.end() ? 0 : found->second;
+    return found == _bytes.end() ? std::nullopt : std::optional(found->second);
 }

@@ -3,9 +3,12 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <memory>
+#include <optional>
 #include <set>
 #include <span>
 #include <unordered_map>
+#include <utility>
 
 #include "platform/linux/Procfs.h"
 
@@ -34,14 +37,16 @@ bool readPart(std::span<const std::byte> part, Family family, SocketBytes& bytes
 /// another one has to be entered, which a thread made for it does.
 class SocketMemory {
 public:
-    /// Of the namespace of the process with this directory. Where it cannot be entered, or where the kernel
-    /// has no such lists, sockets hold nothing.
-    explicit SocketMemory(int processDirectory);
+    /// Of the namespace with this number, in which the process with this directory is. None where it cannot
+    /// be entered, or where the kernel has no such lists.
+    static std::unique_ptr<SocketMemory> ofNamespace(uint64_t number, int processDirectory);
 
-    /// `descriptor` is the entry that leads to the socket in `directory`, a process's "fd".
-    uint64_t bytesOf(uint64_t inode, int directory, const char* descriptor);
+    /// None for a socket that is not in the namespace. `descriptor` is the entry that leads to the socket in
+    /// `directory`, a process's "fd".
+    std::optional<uint64_t> bytesOf(uint64_t inode, int directory, const char* descriptor);
 
 private:
+    explicit SocketMemory(procfs::Descriptor connection) : _connection(std::move(connection)) {}
     void _list(sockdiag::Family family);
 
     procfs::Descriptor _connection;
