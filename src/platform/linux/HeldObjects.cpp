@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <array>
 #include <optional>
+#include <utility>
 
 #include "platform/linux/Fdinfo.h"
 #include "platform/linux/ProcText.h"
@@ -237,8 +238,10 @@ uint64_t DescriptorTargets::bytesOf(const Socket& socket) {
             return *bytes;
         }
     }
-    const procfs::Descriptor self = procfs::open(AT_FDCWD, "/proc/thread-self", O_PATH);
-    _socketsOf(procfs::readNamespace(self.get(), "net"), self.get());
+    if (!std::exchange(_triedOwnNamespace, true)) {
+        const procfs::Descriptor self = procfs::open(AT_FDCWD, "/proc/thread-self", O_PATH);
+        _socketsOf(procfs::readNamespace(self.get(), "net"), self.get());
+    }
     for (const auto& [number, other] : _sockets) {
         if (other != nullptr && other.get() != own) {
             if (const auto bytes = other->bytesOf(socket.inode, socket.directory, socket.descriptor)) {

@@ -58,6 +58,7 @@ private:
     std::mutex _mutex;
     std::map<std::pair<uint64_t, std::string>, std::shared_ptr<const MemoryMounts>> _mounts;
     std::map<uint64_t, std::unique_ptr<SocketMemory>> _sockets;  ///< by network namespace
+    bool _triedOwnNamespace = false;                             ///< the tool's
 };
 
 struct DescriptorScan {
