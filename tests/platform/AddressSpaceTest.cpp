@@ -16,11 +16,10 @@ constexpr uint64_t kPage = 4096;
 class AddressSpaceTest : public testing::Test {
 protected:
     AddressSpace build(const std::string& smaps, int32_t pid = 10, uint64_t ipcNamespace = 1) {
-        return {procfs::parseSmaps(smaps),
+        return {backedVmas(procfs::parseSmaps(smaps), _devices, -1),
                 {.pid = pid,
                  .startTime = 5,
                  .ipcNamespace = ipcNamespace,
-                 .directory = -1,
                  .family = [this]() -> ForkFamily& { return _family; }},
                 _pages,
                 {_identity, _devices, _names, kPage}};

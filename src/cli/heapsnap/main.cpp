@@ -4,7 +4,7 @@
 
 int main(int argc, char* argv[]) {
     MWPrepareProgram();
-    MWLinuxHost host;
+    MWLinuxHost host("/proc", "/sys", MappingSource::smaps);
     MWHostInterface::setCurrent(&host);
     return MWHeapsnapMain(argc, argv);
 }

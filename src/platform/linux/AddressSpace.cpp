@@ -98,8 +98,11 @@ vm_region_submap_info_64 infoFor(const BackedVma& backed, uint64_t pageSize) {
     const Vma& vma = backed.vma;
     vm_region_submap_info_64 info;
     info.protection = protectionBits(vma.readable, vma.writable, vma.executable);
-    info.max_protection = protectionBits(vma.has(procfs::VmFlagMayRead), vma.has(procfs::VmFlagMayWrite),
-                                         vma.has(procfs::VmFlagMayExecute));
+    // Every readable mapping has flags; those of mappings that `maps` told are not known.
+    info.max_protection =
+        vma.flags == 0 ? info.protection
+                       : protectionBits(vma.has(procfs::VmFlagMayRead), vma.has(procfs::VmFlagMayWrite),
+                                        vma.has(procfs::VmFlagMayExecute));
     info.pages_resident = pageCount(vma.resident(), pageSize);
     info.pages_reusable = pageCount(vma.lazyFree, pageSize);
     info.pages_swapped_out = pageCount(vma.swap, pageSize);
@@ -335,14 +338,18 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
                                                                                    : Backing::file;
 }
 
-AddressSpace::AddressSpace(std::vector<Vma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
-                           const AddressSpaceContext& context) {
+std::vector<BackedVma> backedVmas(std::vector<Vma> vmas, ShmemDevices& shmemDevices, int processDirectory) {
     std::vector<BackedVma> backed;
     backed.reserve(vmas.size());
     for (Vma& vma : vmas) {
-        const Backing backing = backingOf(vma, context.shmemDevices, owner.directory);
+        const Backing backing = backingOf(vma, shmemDevices, processDirectory);
         backed.push_back({std::move(vma), backing});
     }
+    return backed;
+}
+
+AddressSpace::AddressSpace(std::vector<BackedVma> backed, const AddressSpaceOwner& owner, PageSource& pages,
+                           const AddressSpaceContext& context) {
     LinuxImages images = imagesOfVmas(backed);
     const std::vector<uint32_t> tags = tagsForVmas(backed, images, context.names);
     _regions.reserve(backed.size());

@@ -20,7 +20,6 @@ struct AddressSpaceOwner {
     int32_t pid = 0;
     uint64_t startTime = 0;  ///< clock ticks since boot: with the pid it names one process of this boot
     uint64_t ipcNamespace = 0;
-    int directory = -1;  ///< /proc/PID, for the mounts it sees
     /// Its fork family; asked only where memory is shared by fork.
     std::function<ForkFamily&()> family;
 };
@@ -54,10 +53,10 @@ struct AddressSpaceRegion {
 
 /// One consistent look at a process's mappings, turned into regions: ascending, without overlap, none empty.
 /// A mapping is one region, unless its pages have different owners: then each run of one owner is. Built from
-/// one pass over `smaps` and the pages of those mappings; immutable afterwards.
+/// the mappings with their counts, and their pages; immutable afterwards.
 class AddressSpace {
 public:
-    AddressSpace(std::vector<procfs::Vma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
+    AddressSpace(std::vector<BackedVma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
                  const AddressSpaceContext& context);
 
     const std::vector<AddressSpaceRegion>& regions() const { return _regions; }
@@ -74,6 +73,10 @@ private:
     std::vector<LinuxImage> _images;
     uint64_t _partOfFamilyMemory = 0;
 };
+
+/// The mappings with what backs them; see backingOf.
+std::vector<BackedVma> backedVmas(std::vector<procfs::Vma> vmas, ShmemDevices& shmemDevices,
+                                  int processDirectory);
 
 /// Everything that a mapping's path, flags and device tell of its backing.
 Backing backingOf(const procfs::Vma& vma, ShmemDevices& shmemDevices, int processDirectory);

@@ -23,6 +23,8 @@ constexpr uint64_t kGoHeapStart = 0xc000000000;
 constexpr uint64_t kShadowStart = 0x7fff7000;
 constexpr uint64_t kShadowEnd = 0x10007fff8000;
 
+constexpr std::string_view kMainStack = "[stack]";
+
 bool isInaccessible(const Vma& vma) {
     return !vma.readable && !vma.writable && !vma.executable;
 }
@@ -293,4 +295,25 @@ bool AnonymousTagger::_isPythonMemory(size_t index) const {
 
 bool AnonymousTagger::_isOffHeap(size_t index) const {
     return (_traits.runsJava() || _traits.runsNode()) && isLargeBlock(_vma(index));
+}
+
+bool anonymousTagsNeedFlags(const std::vector<BackedVma>& vmas) {
+    const ProgramTraits traits(vmas);
+    if (traits.runsJava() || traits.runsNode() || traits.runsPython() || traits.loadsJvm() ||
+        traits.loadsJemalloc() || traits.loadsMimalloc() || traits.hasSanitizerShadow()) {
+        return true;
+    }
+    const BackedVma* previous = nullptr;
+    for (const BackedVma& backed : vmas) {
+        const Vma& vma = backed.vma;
+        const bool follows = previous != nullptr && previous->vma.end == vma.start;
+        const bool bordersOnStack = follows && previous->backing == Backing::anonymous &&
+                                    (vma.path == kMainStack || previous->vma.path == kMainStack);
+        const bool canBeArena = vma.writable && vma.start % kArenaSize == 0 && vma.size() % kArenaSize == 0;
+        if (backed.backing == Backing::anonymous && (isInaccessible(vma) || bordersOnStack || canBeArena)) {
+            return true;
+        }
+        previous = &backed;
+    }
+    return false;
 }

@@ -86,3 +86,7 @@ private:
     ProgramTraits _traits;
     uint64_t _goHeapEnd = 0;  ///< where the contiguous mappings from Go's first heap address end
 };
+
+/// Whether the flags of smaps can make a difference to a tag: what lies beside a guard or a reserve, at the
+/// places of arenas and stacks, or in a program whose allocator is known by its flags.
+bool anonymousTagsNeedFlags(const std::vector<BackedVma>& vmas);

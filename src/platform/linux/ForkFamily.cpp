@@ -80,10 +80,18 @@ std::optional<uint64_t> randomBytesAddress(std::string_view auxv) {
                     : findAuxiliaryValue<uint32_t>(auxv, AT_RANDOM);
 }
 
+std::optional<uint64_t> randomBytesIdentifier(int processDirectory, int32_t pid,
+                                              const ObjectIdentity& identity) {
+    std::string auxv;
+    procfs::readRecord(processDirectory, "auxv", auxv);
+    const auto bytes = readRandomBytes(pid, auxv);
+    return bytes ? std::optional(identity.bytes({bytes->data(), bytes->size()})) : std::nullopt;
+}
+
 uint64_t forkFamilyIdentifier(int procDirectory, int processDirectory, int32_t pid,
                               const ObjectIdentity& identity) {
     std::string auxv;
-    procfs::readFile(processDirectory, "auxv", auxv);
+    procfs::readRecord(processDirectory, "auxv", auxv);
     if (const auto bytes = readRandomBytes(pid, auxv)) {
         return identity.bytes({bytes->data(), bytes->size()});
     }

@@ -50,9 +50,13 @@ private:
 /// address randomisation, when unrelated processes have the same ones, the oldest of a chain of parents that
 /// run the same executable.
 ///
-/// `procDirectory` and `processDirectory` are descriptors of /proc and /proc/PID. Costs five system calls.
+/// `procDirectory` and `processDirectory` are descriptors of /proc and /proc/PID. Costs four system calls.
 uint64_t forkFamilyIdentifier(int procDirectory, int processDirectory, int32_t pid,
                               const ObjectIdentity& identity);
+
+/// The same by the random bytes alone; none where they cannot be read.
+std::optional<uint64_t> randomBytesIdentifier(int processDirectory, int32_t pid,
+                                              const ObjectIdentity& identity);
 
 /// The address of the random bytes in the text of `auxv`.
 std::optional<uint64_t> randomBytesAddress(std::string_view auxv);

@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/sysinfo.h>
 #include <unistd.h>
 
@@ -11,25 +10,12 @@
 #include <optional>
 #include <utility>
 
+#include "platform/linux/Cachestat.h"
 #include "platform/linux/Fdinfo.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
 
 namespace {
-
-// Newer than the C library's headers.
-constexpr long kCachestatCall = 451;  // Linux 6.5
-struct CachestatRange {
-    uint64_t offset;
-    uint64_t length;  ///< 0 for up to the end
-};
-struct Cachestat {
-    uint64_t cached;
-    uint64_t dirty;
-    uint64_t writeback;
-    uint64_t evicted;
-    uint64_t recentlyEvicted;
-};
 
 bool isSwapInUse() {
     struct sysinfo system = {};
@@ -43,10 +29,8 @@ uint64_t swappedBytes(int directory, const char* path, uint64_t pageSize) {
         return 0;
     }
     const procfs::Descriptor file = procfs::open(directory, path, O_NONBLOCK | O_NOCTTY);
-    CachestatRange range = {.offset = 0, .length = 0};
-    Cachestat pages = {};
-    const bool known = file && syscall(kCachestatCall, file.get(), &range, &pages, 0) == 0;
-    return known ? pages.evicted * pageSize : 0;
+    const std::optional<Cachestat> pages = file ? readCachestat(file.get()) : std::nullopt;
+    return pages ? pages->evicted * pageSize : 0;
 }
 
 std::optional<uint64_t> numberInBrackets(std::string_view text) {

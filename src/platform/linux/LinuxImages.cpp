@@ -38,10 +38,20 @@ bool isBss(const BackedVma& before, const BackedVma& backed) {
            backed.backing == Backing::anonymous && backed.vma.path.empty() && isPlainData(backed.vma);
 }
 
+bool hasWrittenPages(const Vma& vma) {
+    return vma.anonymous != 0 || vma.swap != 0;
+}
+
 // A mapping that was writable once stays charged to the commit limit. Where the flags are not known (every
 // readable mapping has some), written pages tell the same; a loader writes behind the code.
 bool wasWritten(const Vma& vma, bool codeSeen) {
-    return vma.flags != 0 ? vma.has(procfs::VmFlagAccountable) : codeSeen && vma.anonymous != 0;
+    return vma.flags != 0 ? vma.has(procfs::VmFlagAccountable) : codeSeen && hasWrittenPages(vma);
+}
+
+// Whether `vma` goes on in the file where `before` ends.
+bool continues(const Vma& vma, const Vma& before) {
+    return before.end == vma.start && before.offset + before.size() == vma.offset &&
+           before.inode == vma.inode && before.device() == vma.device();
 }
 
 // None for a mapping without access: it only keeps its place.
@@ -132,4 +142,18 @@ LinuxImages imagesOfVmas(const std::vector<BackedVma>& vmas) {
         }
     }
     return collector.finish();
+}
+
+// Constants of which the loader wrote none would lie in the same segment of the file as the data behind them.
+bool imagesNeedFlags(const std::vector<BackedVma>& vmas) {
+    for (size_t index = 1; index < vmas.size(); ++index) {
+        const Vma& before = vmas[index - 1].vma;
+        const Vma& vma = vmas[index].vma;
+        if (isPrivateFile(vmas[index]) && isPlainData(vma) && isPrivateFile(vmas[index - 1]) &&
+            before.readable && !before.writable && !before.executable && !hasWrittenPages(before) &&
+            continues(vma, before)) {
+            return true;
+        }
+    }
+    return false;
 }

@@ -44,3 +44,7 @@ struct LinuxImages {
 /// pages count as dirty, and would be counted as text and as data where a program maps its code buffer twice.
 /// Costs n log n in mappings.
 LinuxImages imagesOfVmas(const std::vector<BackedVma>& vmas);
+
+/// Whether, of mappings without flags, one could be constants or be code: it lies where constants do and has
+/// no written pages to tell.
+bool imagesNeedFlags(const std::vector<BackedVma>& vmas);

@@ -15,11 +15,17 @@ namespace {
 
 std::optional<procfs::ProcStat> readStat(int directory) {
     std::string text;
-    return procfs::readFile(directory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
+    return procfs::readRecord(directory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
 }
 
 procfs::Descriptor openDirectory(int parent, const std::string& path) {
     return procfs::open(parent, path.c_str(), O_PATH | O_DIRECTORY);
+}
+
+procfs::ProcStat endedThread() {
+    procfs::ProcStat stat;
+    stat.state = 'X';
+    return stat;
 }
 
 std::string bootId(int procDirectory) {
@@ -36,14 +42,23 @@ bool mayLook(int memoryDirectory) {
 
 }  // namespace
 
-LinuxRun::LinuxRun(const std::string& procDirectory)
+LinuxRun::LinuxRun(const std::string& procDirectory, MappingSource source)
     : proc(procfs::open(AT_FDCWD, procDirectory.c_str(), O_DIRECTORY)),
       pageSize(static_cast<uint64_t>(sysconf(_SC_PAGESIZE))),
       identity(bootId(proc.get())),
       ownedObjects(
           {.proc = proc.get(), .pageSize = pageSize, .shmemDevices = shmemDevices, .identity = identity}),
+      uncountedPages(proc.get()),
+      forkCensus(proc.get(), identity),
       frames(procfs::open(proc.get(), "kpageflags")),
-      untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)) {}
+      untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)),
+      mappingSource(source) {}
+
+void LinuxRun::begin() {
+    ownedObjects.begin();
+    uncountedPages.begin();
+    forkCensus.begin();
+}
 
 LinuxTask::LinuxTask(LinuxRun& run, int32_t pid)
     : _run(run), _pid(pid), _directory(openDirectory(run.proc.get(), std::to_string(pid))), _threadId(pid) {}
@@ -54,7 +69,7 @@ LiveThread openLiveThread(int processDirectory) {
         procfs::Descriptor thread = openDirectory(threads, name);
         const auto stat = thread ? readStat(thread.get()) : std::nullopt;
         if (stat && !stat->threadEnded()) {
-            found = {stat->pid, std::move(thread)};
+            found = {stat->pid, std::move(thread), *stat};
         }
         return !found.directory;
     });
@@ -72,6 +87,7 @@ std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
         return nullptr;
     }
     task->_startTime = stat->startTime;
+    task->_stat = *stat;
     task->_chooseThread();
     return mayLook(task->memoryDirectory()) ? std::move(task) : nullptr;
 }
@@ -80,37 +96,94 @@ LinuxTask::~LinuxTask() {
     _run.sharedSpaces.forget({_pid, _startTime});
 }
 
+// By what was last seen of the thread.
 bool LinuxTask::_chooseThread() {
-    const auto chosen = readStat(memoryDirectory());
-    if (chosen && !chosen->threadEnded()) {
+    if (!_stat.threadEnded()) {
         return true;
     }
     LiveThread thread = openLiveThread(directory());
     _threadId = thread.directory ? thread.identifier : _pid;
     _thread = std::move(thread.directory);
+    _stat = thread.stat;
     return static_cast<bool>(_thread);
 }
 
 // A text that a thread's end or its exec cuts short ends like any other, so the thread is looked at before
 // and after: when it has ended another one is asked, when it runs another program the text is read again.
-kern_return_t LinuxTask::_readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack) {
+kern_return_t LinuxTask::_readMappings(Mappings& mappings) {
     constexpr int kAttempts = 5;
-    for (int attempt = 0; attempt < kAttempts; ++attempt) {
-        if (!_chooseThread()) {
-            return MACH_SEND_INVALID_DEST;
-        }
-        const auto before = readStat(memoryDirectory());
-        const bool read = procfs::readMappings(memoryDirectory(), "smaps", vmas);
+    for (int attempt = 0; attempt < kAttempts && _chooseThread(); ++attempt) {
+        const bool read = _readMappingsOnce(mappings);
         if (!read && errno != ESRCH) {
             return KERN_FAILURE;
         }
-        const auto after = readStat(memoryDirectory());
-        if (read && before && after && !after->threadEnded() && after->isSameProgramAs(*before)) {
-            startStack = after->startStack;
-            return vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
+        const procfs::ProcStat before = std::move(_stat);
+        _stat = readStat(memoryDirectory()).value_or(endedThread());
+        if (read && !_stat.threadEnded() && _stat.isSameProgramAs(before)) {
+            return mappings.vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
         }
     }
     return MACH_SEND_INVALID_DEST;
+}
+
+// Looking at the whole system for what smaps would tell pays off where much is measured.
+bool LinuxTask::_countsPayOff(const procfs::ProcStatus& status) const {
+    constexpr size_t kManyProcesses = 8;
+    constexpr uint64_t kLargeProcess = 16U << 20U;
+    return _run.mappingSource == MappingSource::cheapest &&
+           (_run.forkCensus.measured() >= kManyProcesses ||
+            status.rssAnon + status.rssFile + status.rssShmem >= kLargeProcess);
+}
+
+bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
+    const int directory = memoryDirectory();
+    _pages.emplace(directory, PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
+    mappings = {};
+    std::vector<procfs::Vma> vmas;
+    const auto status = _readStatus();
+    if (status && _countsPayOff(*status)) {
+        if (!procfs::readMappings(directory, "maps", vmas)) {
+            return false;
+        }
+        mappings.vmas = backedVmas(std::move(vmas), _run.shmemDevices, directory);
+        const PageScanner scan = [this](const PageScan& pages, std::span<ScannedRange> ranges,
+                                        uint64_t& end) { return _pages->scan(pages, ranges, end); };
+        mappings.counts = countWithoutSmaps(mappings.vmas,
+                                            {.pid = _pid,
+                                             .memoryDirectory = directory,
+                                             .status = *status,
+                                             .scan = scan,
+                                             .pages = *_pages,
+                                             .pageSize = _run.pageSize},
+                                            _run.uncountedPages, _run.forkCensus);
+        if (mappings.counts) {
+            return true;
+        }
+    }
+    if (!procfs::readMappings(directory, "smaps", vmas)) {
+        return false;
+    }
+    mappings.vmas = backedVmas(std::move(vmas), _run.shmemDevices, directory);
+    return true;
+}
+
+std::optional<procfs::ProcStatus> LinuxTask::_readStatus() {
+    std::string text;
+    const bool read = procfs::readRecord(memoryDirectory(), "status", text);
+    _statusAtHand = read ? std::optional(procfs::parseStatus(text)) : std::nullopt;
+    _statusServes = StatusUse::charge;
+    return _statusAtHand;
+}
+
+std::optional<procfs::ProcStatus> LinuxTask::status(StatusUse use) {
+    if (!_statusAtHand || _statusServes != use) {
+        _readStatus();
+    }
+    if (use == StatusUse::charge && _statusAtHand) {
+        _statusServes = StatusUse::pageTables;
+        return _statusAtHand;
+    }
+    return std::exchange(_statusAtHand, std::nullopt);
 }
 
 ForkFamily& LinuxTask::_family() {
@@ -125,21 +198,25 @@ kern_return_t LinuxTask::takeSnapshot() {
     if (_space) {
         return KERN_SUCCESS;
     }
-    std::vector<procfs::Vma> vmas;
-    uint64_t startStack = 0;
-    const kern_return_t code = _readMappings(vmas, startStack);
+    Mappings mappings;
+    const kern_return_t code = _readMappings(mappings);
     if (code != KERN_SUCCESS) {
         return code;
     }
-    _pages.emplace(memoryDirectory(), PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
-    const ProcessIdentity owner = _run.sharedSpaces.ownerOf(_candidate(startStack));
-    _space.emplace(std::move(vmas),
-                   AddressSpaceOwner{.pid = owner.pid,
-                                     .startTime = owner.startTime,
-                                     .ipcNamespace = procfs::readNamespace(memoryDirectory(), "ipc"),
-                                     .directory = memoryDirectory(),
-                                     .family = [this]() -> ForkFamily& { return _family(); }},
-                   *_pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
+    std::optional<ScannedPages> scanned;
+    if (mappings.counts && !mappings.counts->sharesByFork) {
+        scanned.emplace(std::move(mappings.counts->filePages), _run.pageSize);
+    }
+    PageSource& pages = scanned ? static_cast<PageSource&>(*scanned) : *_pages;
+    const bool isAlone = scanned.has_value();
+    const ProcessIdentity owner = _run.sharedSpaces.ownerOf(_candidate());
+    _space.emplace(
+        std::move(mappings.vmas),
+        AddressSpaceOwner{.pid = owner.pid,
+                          .startTime = owner.startTime,
+                          .ipcNamespace = procfs::readNamespace(memoryDirectory(), "ipc"),
+                          .family = [&]() -> ForkFamily& { return isAlone ? _noFamily : _family(); }},
+        pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
     if (owner.pid == _pid) {
         _checkFamilyMemory();
     }
@@ -165,11 +242,17 @@ void LinuxTask::_checkFamilyMemory() {
 }
 
 bool LinuxTask::sharesAnothersSpace() {
-    const auto stat = readStat(memoryDirectory());
-    return stat && _run.sharedSpaces.ownerOf(_candidate(stat->startStack)).pid != _pid;
+    return _run.sharedSpaces.ownerOf(_candidate()).pid != _pid;
 }
 
-void LinuxTask::surveyOwnedObjects() {
+void LinuxTask::survey() {
+    _surveyOwnedObjects();
+    if (_run.mappingSource == MappingSource::cheapest) {
+        _run.forkCensus.add(_pid, randomBytesIdentifier(memoryDirectory(), _threadId, _run.identity));
+    }
+}
+
+void LinuxTask::_surveyOwnedObjects() {
     _run.ownedObjects.add({_pid, _startTime}, memoryDirectory());
 }
 
@@ -178,7 +261,7 @@ void LinuxTask::surveyOwnedObjects() {
 std::vector<OwnedObjectRecord> LinuxTask::ownedObjects() {
     const ProcessIdentity process = {_pid, _startTime};
     if (!_run.ownedObjects.knows(process)) {
-        surveyOwnedObjects();
+        _surveyOwnedObjects();
     }
     std::optional<std::unordered_set<uint64_t>> shown;
     return _run.ownedObjects.objectsOf(process, [&](uint64_t identifier) {

@@ -11,16 +11,26 @@
 
 #include "platform/MWHostRecords.h"
 #include "platform/linux/AddressSpace.h"
+#include "platform/linux/ForkCensus.h"
 #include "platform/linux/LivePages.h"
+#include "platform/linux/MappingCounts.h"
 #include "platform/linux/OwnedObjectSurvey.h"
 #include "platform/linux/PageDispositions.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
 #include "platform/linux/SharedAddressSpaces.h"
+#include "platform/linux/UncountedPages.h"
+
+/// Where the counts of a mapping come from.
+enum class MappingSource : uint8_t {
+    smaps,     ///< with everything that it tells
+    cheapest,  ///< the figures are the same; what no report shows (the protections that a mapping may have)
+               ///< is not
+};
 
 /// What all the tasks of a run share.
 struct LinuxRun {
-    explicit LinuxRun(const std::string& procDirectory);
+    LinuxRun(const std::string& procDirectory, MappingSource mappingSource);
 
     procfs::Descriptor proc;
     uint64_t pageSize;
@@ -30,15 +40,21 @@ struct LinuxRun {
     ForkFamilies families;
     SharedAddressSpaces sharedSpaces;
     OwnedObjectSurvey ownedObjects;
+    UncountedPages uncountedPages;
+    ForkCensus forkCensus;
     PageFrameFlags frames;
     PagemapEntry untouchedPage;  ///< of this process, to know the zero page by
+    MappingSource mappingSource;
 
+    /// A new measurement begins: what was found out about processes for the last one is forgotten.
+    void begin();
     bool seesFrames() const { return untouchedPage.frame() != 0; }
 };
 
 struct LiveThread {
     int32_t identifier = 0;
     procfs::Descriptor directory;
+    procfs::ProcStat stat;
 };
 /// A thread of the process that has not ended; without a directory when there is none left.
 LiveThread openLiveThread(int processDirectory);
@@ -76,10 +92,15 @@ public:
     /// snapshot. KERN_INVALID_ARGUMENT when the process has ended.
     kern_return_t fillDispositions(uint64_t start, std::span<int32_t> words);
 
+    /// `status`, as fresh as the last question about memory: the charge and the page tables of one process
+    /// are asked for together, and the charge again after a snapshot. None when the process is gone.
+    enum class StatusUse : uint8_t { charge, pageTables };
+    std::optional<procfs::ProcStatus> status(StatusUse use);
+
     /// Whether its memory goes under another process's name, with which it shares one address space.
     bool sharesAnothersSpace();
-    /// Looks at what the process holds through descriptors, for the choice of owners.
-    void surveyOwnedObjects();
+    /// Looks at what the process holds through descriptors and at its family, before any process is measured.
+    void survey();
     /// What the process is charged for beside its regions. May take a snapshot.
     std::vector<OwnedObjectRecord> ownedObjects();
 
@@ -89,11 +110,20 @@ private:
     /// The directory to read memory through: that of a thread that lives.
     /// False when no thread of the process lives.
     bool _chooseThread();
-    kern_return_t _readMappings(std::vector<procfs::Vma>& vmas, uint64_t& startStack);
+    void _surveyOwnedObjects();
+
+    struct Mappings {
+        std::vector<BackedVma> vmas;
+        std::optional<MappingCounts> counts;  ///< where smaps was not read
+    };
+    kern_return_t _readMappings(Mappings& mappings);
+    bool _readMappingsOnce(Mappings& mappings);
+    bool _countsPayOff(const procfs::ProcStatus& status) const;
+    std::optional<procfs::ProcStatus> _readStatus();
     std::unordered_set<uint64_t> _shownObjects();
     bool _readEntries(const AddressSpaceRegion& region, uint64_t address);
-    SharedAddressSpaces::Candidate _candidate(uint64_t startStack) const {
-        return {{_pid, _startTime}, _threadId, startStack};
+    SharedAddressSpaces::Candidate _candidate() const {
+        return {{_pid, _startTime}, _threadId, _stat.startStack};
     }
     ForkFamily& _family();
     void _checkFamilyMemory();
@@ -102,9 +132,13 @@ private:
     int32_t _pid;
     uint64_t _startTime = 0;
     procfs::Descriptor _directory;
-    int32_t _threadId;                        ///< a thread that lives
-    procfs::Descriptor _thread;               ///< its task/TID, when it is not the first one
+    int32_t _threadId;           ///< a thread that lives
+    procfs::Descriptor _thread;  ///< its task/TID, when it is not the first one
+    procfs::ProcStat _stat;      ///< of that thread, as last seen
+    std::optional<procfs::ProcStatus> _statusAtHand;
+    StatusUse _statusServes = StatusUse::charge;  ///< the question that it is kept for
     std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live
+    ForkFamily _noFamily{0};                  ///< of a process that shares nothing by fork
     std::vector<std::string> _warnings;
     std::optional<LivePages> _pages;
     std::optional<AddressSpace> _space;

@@ -1,6 +1,5 @@
 #include "platform/linux/LivePages.h"
 
-#include <sys/ioctl.h>
 #include <sys/mman.h>
 #include <unistd.h>
 
@@ -8,58 +7,7 @@
 #include <array>
 #include <vector>
 
-namespace {
-
-// PAGEMAP_SCAN, Linux 6.7; the headers of older systems do not have it.
-struct PageRegion {
-    uint64_t start;
-    uint64_t end;
-    uint64_t categories;
-};
-
-struct ScanArguments {
-    uint64_t size;
-    uint64_t flags;
-    uint64_t start;
-    uint64_t end;
-    uint64_t walkEnd;
-    uint64_t regions;
-    uint64_t regionCount;
-    uint64_t maxPages;
-    uint64_t categoryInverted;
-    uint64_t categoryMask;
-    uint64_t categoryAnyOfMask;
-    uint64_t returnMask;
-};
-
-constexpr unsigned long kPagemapScan = _IOWR('f', 16, ScanArguments);
-constexpr uint64_t kIsPresent = 1U << 3U;
-constexpr uint64_t kIsSwapped = 1U << 4U;
-constexpr uint64_t kIsZeroPage = 1U << 5U;
-
-struct Scan {
-    uint64_t start;
-    uint64_t end;
-    uint64_t categories;  ///< any of them
-};
-
-// Fills the regions that have any of the categories and sets where the scan stopped; the number of regions,
-// or -1 where the kernel cannot scan.
-int scanPages(int pagemap, const Scan& scan, std::span<PageRegion> regions, uint64_t& walkEnd) {
-    ScanArguments arguments = {};
-    arguments.size = sizeof(arguments);
-    arguments.start = scan.start;
-    arguments.end = scan.end;
-    arguments.regions = reinterpret_cast<uint64_t>(regions.data());
-    arguments.regionCount = regions.size();
-    arguments.categoryAnyOfMask = scan.categories;
-    arguments.returnMask = scan.categories;
-    const int count = ioctl(pagemap, kPagemapScan, &arguments);
-    walkEnd = arguments.walkEnd;
-    return count;
-}
-
-}  // namespace
+#include "platform/linux/PageScan.h"
 
 PagemapEntry lookAtUntouchedPage(int procDirectory, uint64_t pageSize) {
     void* page = mmap(nullptr, pageSize, PROT_READ, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
@@ -102,16 +50,16 @@ bool LivePages::readPages(uint64_t address, std::span<PagemapEntry> entries) {
 
 void LivePages::clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) {
     constexpr size_t kRegionsAtOnce = 256;
-    std::array<PageRegion, kRegionsAtOnce> regions;
+    std::array<ScannedRange, kRegionsAtOnce> regions;
     const uint64_t end = address + entries.size() * _facts.pageSize;
     for (uint64_t start = address; start < end;) {
         uint64_t walkEnd = end;
-        const int count = scanPages(_file(), {start, end, kIsZeroPage}, regions, walkEnd);
+        const int count = scanPages(_file(), PageScan::forPages(start, end, kIsZeroPage), regions, walkEnd);
         if (count < 0) {
             _clearByFlags(entries);
             return;
         }
-        for (const PageRegion& region : std::span(regions).first(static_cast<size_t>(count))) {
+        for (const ScannedRange& region : std::span(regions).first(static_cast<size_t>(count))) {
             const auto first =
                 entries.begin() + static_cast<ptrdiff_t>((region.start - address) / _facts.pageSize);
             std::fill_n(first, (region.end - region.start) / _facts.pageSize, PagemapEntry{});
@@ -138,9 +86,9 @@ void LivePages::_clearByFlags(std::span<PagemapEntry> entries) const {
 }
 
 bool LivePages::knowsHoles() {
-    std::array<PageRegion, 1> found = {};
+    std::array<ScannedRange, 1> found = {};
     uint64_t walkEnd = 0;
-    return scanPages(_file(), {0, _facts.pageSize, kIsPresent}, found, walkEnd) >= 0;
+    return scanPages(_file(), PageScan::forPages(0, _facts.pageSize, kIsPresent), found, walkEnd) >= 0;
 }
 
 uint64_t LivePages::nextPopulated(uint64_t address, uint64_t end) {
@@ -148,10 +96,11 @@ uint64_t LivePages::nextPopulated(uint64_t address, uint64_t end) {
     // passed over at once.
     constexpr uint64_t kScannedAtOnce = 64ULL << 30U;
     for (uint64_t start = address; start < end;) {
-        std::array<PageRegion, 1> found = {};
+        std::array<ScannedRange, 1> found = {};
         const uint64_t limit = std::min(end, start + kScannedAtOnce);
         uint64_t walkEnd = limit;
-        const int count = scanPages(_file(), {start, limit, kIsPresent | kIsSwapped}, found, walkEnd);
+        const int count =
+            scanPages(_file(), PageScan::forPages(start, limit, kIsPresent | kIsSwapped), found, walkEnd);
         if (count != 0) {
             return count < 0 ? address : found[0].start;
         }

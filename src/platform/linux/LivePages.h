@@ -5,6 +5,7 @@
 
 #include "platform/linux/OwnershipRuns.h"
 #include "platform/linux/PageFrameFlags.h"
+#include "platform/linux/PageScan.h"
 #include "platform/linux/Procfs.h"
 
 /// What the kernel tells everybody's pages by, found out once for a run.
@@ -31,6 +32,10 @@ public:
     void clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) override;
     uint64_t nextPopulated(uint64_t address, uint64_t end) override;
     bool knowsHoles() override;
+    /// See scanPages.
+    int scan(const PageScan& scan, std::span<ScannedRange> ranges, uint64_t& walkEnd) {
+        return scanPages(_file(), scan, ranges, walkEnd);
+    }
 
 private:
     int _file();

@@ -54,8 +54,9 @@ uint64_t readClock(clockid_t clock) {
 
 }  // namespace
 
-MWLinuxHost::MWLinuxHost(const std::string& procDirectory, const std::string& sysDirectory)
-    : _run(procDirectory), _sys(procfs::open(AT_FDCWD, sysDirectory.c_str(), O_DIRECTORY)) {
+MWLinuxHost::MWLinuxHost(const std::string& procDirectory, const std::string& sysDirectory,
+                         MappingSource mappingSource)
+    : _run(procDirectory, mappingSource), _sys(procfs::open(AT_FDCWD, sysDirectory.c_str(), O_DIRECTORY)) {
     raiseDescriptorLimit();
 }
 
@@ -208,7 +209,7 @@ void MWLinuxHost::forEachImage(task_t task, const std::function<void(const MWIma
 
 void MWLinuxHost::surveyOwnedVmObjects(task_t task) {
     if (LinuxTask* record = _task(task)) {
-        record->surveyOwnedObjects();
+        record->survey();
     }
 }
 

@@ -25,8 +25,8 @@ class MWLinuxHost : public MWHostInterface {
 public:
     /// `procDirectory` is the root of a procfs, or of a tree of recorded files; `sysDirectory` that of a
     /// sysfs.
-    explicit MWLinuxHost(const std::string& procDirectory = "/proc",
-                         const std::string& sysDirectory = "/sys");
+    explicit MWLinuxHost(const std::string& procDirectory = "/proc", const std::string& sysDirectory = "/sys",
+                         MappingSource mappingSource = MappingSource::cheapest);
     ~MWLinuxHost() override;
     MWLinuxHost(const MWLinuxHost&) = delete;
     MWLinuxHost& operator=(const MWLinuxHost&) = delete;
@@ -64,7 +64,7 @@ public:
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
 
-    void beginOwnedVmObjectSurvey() override { _run.ownedObjects.begin(); }
+    void beginOwnedVmObjectSurvey() override { _run.begin(); }
     void surveyOwnedVmObjects(task_t task) override;
     /// What the process holds through descriptors, and its SysV segments that nobody has attached.
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
@@ -106,10 +106,10 @@ private:
     const AddressSpaceRegion* _regionAtOrAbove(task_t task, uint64_t address, kern_return_t& code);
     /// The process's directory: the one that a task of this pid holds open, else opened anew into `opened`.
     int _processDirectory(int32_t pid, procfs::Descriptor& opened);
-    /// A small file of a process; false with errno on failure, ESRCH when the process is gone.
+    /// A record of a process; false with errno on failure, ESRCH when the process is gone.
     bool _readProcessFile(int32_t pid, const char* name, std::string& text);
     std::optional<procfs::ProcStat> _statOfPid(int32_t pid);
-    std::optional<procfs::ProcStatus> _memoryStatusOfPid(int32_t pid);
+    std::optional<procfs::ProcStatus> _memoryStatusOfPid(int32_t pid, LinuxTask::StatusUse use);
 
     /// A copy that the caller gives back.
     template <class Record>

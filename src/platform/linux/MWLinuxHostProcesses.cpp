@@ -86,7 +86,7 @@ int MWLinuxHost::_processDirectory(int32_t pid, procfs::Descriptor& opened) {
 bool MWLinuxHost::_readProcessFile(int32_t pid, const char* name, std::string& text) {
     procfs::Descriptor opened;
     const int directory = _processDirectory(pid, opened);
-    const bool read = directory >= 0 && procfs::readFile(directory, name, text);
+    const bool read = directory >= 0 && procfs::readRecord(directory, name, text);
     if (!read && (errno == ENOENT || errno == EBADF)) {
         errno = ESRCH;
     }
@@ -94,13 +94,12 @@ bool MWLinuxHost::_readProcessFile(int32_t pid, const char* name, std::string& t
 }
 
 // Of a thread that lives: the first one can end before the others.
-std::optional<procfs::ProcStatus> MWLinuxHost::_memoryStatusOfPid(int32_t pid) {
-    procfs::Descriptor opened;
-    const LinuxTask* task = _taskOfPid(pid);
-    const int directory = task != nullptr ? task->memoryDirectory() : _processDirectory(pid, opened);
+std::optional<procfs::ProcStatus> MWLinuxHost::_memoryStatusOfPid(int32_t pid, LinuxTask::StatusUse use) {
+    if (LinuxTask* task = _taskOfPid(pid)) {
+        return task->status(use);
+    }
     std::string text;
-    const bool read = directory >= 0 && procfs::readFile(directory, "status", text);
-    return read ? std::optional(procfs::parseStatus(text)) : std::nullopt;
+    return _readProcessFile(pid, "status", text) ? std::optional(procfs::parseStatus(text)) : std::nullopt;
 }
 
 std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
@@ -144,8 +143,8 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     procfs::Descriptor opened;
     const int directory = _processDirectory(pid, opened);
     std::string text;
-    const auto stat =
-        directory >= 0 && procfs::readFile(directory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
+    const auto stat = directory >= 0 && procfs::readRecord(directory, "stat", text) ? procfs::parseStat(text)
+                                                                                    : std::nullopt;
     if (!stat || stat->isKernelThread()) {
         return noSuchProcess();
     }
@@ -155,16 +154,16 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     record.pbi_status = statusOf(*stat, directory);
     setStartTime(record, stat->startTime);
     copyText(record.pbi_comm, stat->comm);
-    procfs::readFile(directory, "cmdline", text);
+    procfs::readRecord(directory, "cmdline", text);
     copyText(record.pbi_name, procfs::nameFromCommandLine(text));
-    procfs::readFile(directory, "auxv", text);
+    procfs::readRecord(directory, "auxv", text);
     const std::optional<bool> is64bit = procfs::auxvIs64bit(text);
     record.pbi_flags = (is64bit ? *is64bit : executableIs64bit(directory)) ? PROC_FLAG_LP64 : 0;
     return sizeof(record);
 }
 
 int MWLinuxHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
-    const auto status = _memoryStatusOfPid(pid);
+    const auto status = _memoryStatusOfPid(pid, LinuxTask::StatusUse::charge);
     if (!status || !status->hasMemory) {
         return noSuchProcess();
     }
@@ -173,9 +172,9 @@ int MWLinuxHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
     return 0;
 }
 
-int MWLinuxHost::proc_get_dirty(int32_t pid, uint32_t& flags) {
+int MWLinuxHost::proc_get_dirty(int32_t, uint32_t& flags) {
     flags = 0;
-    return _statOfPid(pid) ? 0 : noSuchProcess();
+    return 0;
 }
 
 int MWLinuxHost::sysctlArgumentMaximum(uint64_t& bytes) {
@@ -198,7 +197,7 @@ int MWLinuxHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& l
     if (path.ends_with(kDeleted)) {
         path.resize(path.size() - kDeleted.size());
     }
-    procfs::readFile(directory, "cmdline", arguments);
+    procfs::readRecord(directory, "cmdline", arguments);
     const auto count = static_cast<int32_t>(std::count(arguments.begin(), arguments.end(), '\0'));
     std::string bytes(sizeof(count), '\0');
     std::memcpy(bytes.data(), &count, sizeof(count));
@@ -223,7 +222,7 @@ int MWLinuxHost::ledgerTemplate(std::span<ledger_template_info> records, size_t&
 // Page tables belong to an address space: of processes that share one, only its owner is charged for them.
 int MWLinuxHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) {
     filled = 0;
-    const auto status = _memoryStatusOfPid(pid);
+    const auto status = _memoryStatusOfPid(pid, LinuxTask::StatusUse::pageTables);
     if (!status) {
         return noSuchProcess();
     }

@@ -65,8 +65,10 @@ std::optional<ProcStat> parseStat(std::string_view text) {
 
 ProcStatus parseStatus(std::string_view text) {
     ProcStatus status;
-    const std::array<std::pair<std::string_view, uint64_t*>, 6> fields = {
+    const std::array<std::pair<std::string_view, uint64_t*>, 8> fields = {
         {{"VmHWM:", &status.vmHwm},
+         {"VmLck:", &status.vmLck},
+         {"RssFile:", &status.rssFile},
          {"RssAnon:", &status.rssAnon},
          {"RssShmem:", &status.rssShmem},
          {"VmPTE:", &status.vmPte},
@@ -74,6 +76,10 @@ ProcStatus parseStatus(std::string_view text) {
          {"HugetlbPages:", &status.hugetlbPages}}};
     while (!text.empty()) {
         std::string_view line = takeLine(text);
+        if (takePrefix(line, "x86_Thread_features:")) {
+            status.hasShadowStack = line.find("shstk") != std::string_view::npos;
+            continue;
+        }
         for (const auto& [name, value] : fields) {
             if (takePrefix(line, name)) {
                 *value = parseKilobytes(line).value_or(0);

@@ -37,11 +37,14 @@ struct ProcStat {
 struct ProcStatus {
     uint64_t vmHwm = 0;
     uint64_t rssAnon = 0;
+    uint64_t rssFile = 0;
     uint64_t rssShmem = 0;
     uint64_t vmPte = 0;
     uint64_t vmSwap = 0;  ///< without swapped shmem
     uint64_t hugetlbPages = 0;
-    bool hasMemory = false;  ///< what has ended, and kernel threads, have none and no such lines
+    uint64_t vmLck = 0;           ///< locked by mlock
+    bool hasShadowStack = false;  ///< of x86
+    bool hasMemory = false;       ///< what has ended, and kernel threads, have none and no such lines
 };
 
 /// None when the text is no `stat` line.

@@ -62,6 +62,24 @@ bool readFile(int directory, const char* path, std::string& text, size_t limit) 
     return true;
 }
 
+bool readRecord(int directory, const char* path, std::string& text) {
+    constexpr size_t kRoom = 4096;
+    text.clear();
+    const Descriptor file = open(directory, path);
+    if (!file) {
+        return false;
+    }
+    ptrdiff_t count = 0;
+    size_t length = 0;
+    do {
+        text.resize(length + kRoom);
+        count = readSome(file.get(), std::span(text).subspan(length));
+        length += static_cast<size_t>(std::max<ptrdiff_t>(count, 0));
+    } while (count == static_cast<ptrdiff_t>(kRoom));
+    text.resize(length);
+    return count >= 0;
+}
+
 bool readLink(int directory, const char* path, std::string& target) {
     std::array<char, 4096> buffer = {};
     const ptrdiff_t length = ::readlinkat(directory, path, buffer.data(), buffer.size());

@@ -38,6 +38,10 @@ ptrdiff_t readSome(int descriptor, std::span<char> buffer);
 /// errno on failure, `text` then holds what was read.
 bool readFile(int directory, const char* path, std::string& text, size_t limit = 1U << 20U);
 
+/// The same for a file that the kernel hands out in one piece, such as `stat`: its end need not be looked
+/// for.
+bool readRecord(int directory, const char* path, std::string& text);
+
 /// The target of a symbolic link; false with errno on failure.
 bool readLink(int directory, const char* path, std::string& target);
 

@@ -6,7 +6,6 @@
 
 #include <cerrno>
 #include <cstddef>
-#include <iterator>
 
 namespace {
 
@@ -52,13 +51,21 @@ ProcessIdentity SharedAddressSpaces::ownerOf(const Candidate& candidate) {
         return members[*place].process;
     }
     members.insert(members.begin() + static_cast<ptrdiff_t>(*place), {candidate.process, candidate.thread});
+    _startStacks.emplace(candidate.process.pid, candidate.startStack);
     return candidate.process;
 }
 
 void SharedAddressSpaces::forget(const ProcessIdentity& process) {
     const std::lock_guard lock(_mutex);
-    for (auto entry = _members.begin(); entry != _members.end();) {
-        std::erase_if(entry->second, [&](const Member& member) { return member.process == process; });
-        entry = entry->second.empty() ? _members.erase(entry) : std::next(entry);
+    const auto [first, last] = _startStacks.equal_range(process.pid);
+    for (auto place = first; place != last; ++place) {
+        const auto entry = _members.find(place->second);
+        if (entry != _members.end()) {
+            std::erase_if(entry->second, [&](const Member& member) { return member.process == process; });
+            if (entry->second.empty()) {
+                _members.erase(entry);
+            }
+        }
     }
+    _startStacks.erase(process.pid);
 }

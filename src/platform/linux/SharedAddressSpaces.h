@@ -1,9 +1,9 @@
 #pragma once
 
 #include <cstdint>
-#include <map>
 #include <mutex>
 #include <optional>
+#include <unordered_map>
 #include <vector>
 
 /// A process by what names it for good: its pid can be given away, its start time cannot.
@@ -41,5 +41,6 @@ private:
     static std::optional<size_t> _place(Members& members, int32_t thread);
 
     std::mutex _mutex;
-    std::map<uint64_t, Members> _members;  ///< by start of stack, in the kernel's order of spaces
+    std::unordered_map<uint64_t, Members> _members;  ///< by start of stack, in the kernel's order of spaces
+    std::unordered_multimap<int32_t, uint64_t> _startStacks;  ///< by pid: where the process is a member
 };
