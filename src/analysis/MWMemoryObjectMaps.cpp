@@ -57,6 +57,12 @@ MWMemoryObject& MWMemoryObjectMaps::_addUniqueObject() {
     return *_uniqueMemoryObjects.emplace_back(std::make_shared<MWMemoryObject>());
 }
 
+size_t MWMemoryObjectMaps::objectCount() const {
+    return _memoryObjects.size() + _sharedCacheMemoryObjects.size() +
+           _sharedCacheTranslatedMemoryObjects.size() + _uniqueMemoryObjects.size() +
+           _textMemoryObjects.size() + _linkeditMemoryObjects.size();
+}
+
 void MWMemoryObjectMaps::forEachObject(const std::function<void(MWMemoryObject&)>& block) const {
     const auto walk = [&](const MWMemoryObjectMap& map) {
         for (const auto& [key, object] : map) {

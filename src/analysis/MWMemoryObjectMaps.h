@@ -29,6 +29,7 @@ public:
     /// The object that `region` of `process` belongs to, new when no region of it was met before. A region
     /// without a usable key gets an object of its own at every call.
     MWMemoryObject& objectForRegion(const MWMemoryRegion& region, const MWProcess& process);
+    size_t objectCount() const;
     /// Every object once.
     void forEachObject(const std::function<void(MWMemoryObject&)>& block) const;
 

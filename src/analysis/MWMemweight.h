@@ -121,8 +121,7 @@ private:
     static const MWMemoryRegionList& _regionsOf(const MWProcess& process);
 
     static Messages _collectMessages(const MWProcessOrder& processes);
-    void _printProcess(const MWProcess& process, const MWProcessToProcessGroups& groupsOf,
-                       bool summarize) const;
+    void _printProcess(const MWProcess& process, bool summarize) const;
     void _printProcessHead(const MWProcess& process, bool hasErrors) const;
     void _printGroup(const MWProcess& process, MWProcessGroup& group, bool summarize) const;
     void _printSummary(const MWProcessOrder& processes, bool summarize) const;
@@ -133,6 +132,7 @@ private:
     /// groups. Those that only hidden processes map do not: the regions of hidden processes then refer to
     /// objects that are gone, and nobody may follow them any more.
     std::optional<MWMemoryObjectMaps> _objectMaps;
+    MWProcessToProcessGroups _groupsOf;
     std::vector<MWOutputFormatter*> _outputFormatters;
     std::atomic<bool> _earlyExit = false;
     uint32_t _qualityOfService = QOS_CLASS_UTILITY;

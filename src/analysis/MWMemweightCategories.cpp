@@ -1,12 +1,13 @@
+#include <tsl/robin_set.h>
+
 #include <algorithm>
 #include <numeric>
-#include <unordered_set>
 
 #include "analysis/MWMemweight.h"
 
 namespace {
 
-using ObjectSet = std::unordered_set<const MWMemoryObject*>;
+using ObjectSet = tsl::robin_set<const MWMemoryObject*>;
 
 /// The row that the object belongs to, whatever part of it is seen.
 MWMemoryCategory& categoryForObject(MWCategoryTable& table, const MWMemoryObject& object, bool summarize) {

@@ -1,4 +1,7 @@
+#include <tsl/robin_map.h>
+
 #include <algorithm>
+#include <memory>
 #include <set>
 #include <unordered_map>
 #include <unordered_set>
@@ -31,20 +34,42 @@ struct GroupEqual {
 
 using GroupSet = std::unordered_set<Group, GroupHash, GroupEqual>;
 
+/// The processes that map one object: most objects have one, so a set is made for the second.
 struct Sharers {
     const MWMemoryObject* object;
-    MWProcessGroupMinimal processes;
+    const MWProcess* first;
+    std::unique_ptr<MWProcessGroupMinimal> all = nullptr;
+
+    void add(const MWProcess& process) {
+        if (all == nullptr) {
+            if (first->isEqual(process)) {
+                return;
+            }
+            all = std::make_unique<MWProcessGroupMinimal>();
+            all->addProcess(*first);
+        }
+        all->addProcess(process);
+    }
 };
 
 /// The sharer set of each object, in the order in which the objects are first met.
 class SharerSets {
 public:
-    explicit SharerSets(std::set<int32_t> displayedPids) : _displayedPids(std::move(displayedPids)) {}
+    SharerSets(std::set<int32_t> displayedPids, size_t objects) : _displayedPids(std::move(displayedPids)) {
+        _indexes.reserve(objects);
+        _sharers.reserve(objects);
+    }
 
     void addRegion(const MWMemoryRegion& region, const MWProcess& process) {
         const MWMemoryObject* object = region.memoryObject();
-        if (!process.hiddenFromDisplay() || _admitsHidden(*object)) {
-            _sharersOf(object).addProcess(process);
+        if (process.hiddenFromDisplay() && !_admitsHidden(*object)) {
+            return;
+        }
+        const auto [entry, isNew] = _indexes.try_emplace(object, _sharers.size());
+        if (isNew) {
+            _sharers.push_back({.object = object, .first = &process});
+        } else {
+            _sharers[entry->second].add(process);
         }
     }
     const std::vector<Sharers>& all() const { return _sharers; }
@@ -62,33 +87,51 @@ private:
         }
         return entry->second;
     }
-    MWProcessGroupMinimal& _sharersOf(const MWMemoryObject* object) {
-        const auto [entry, isNew] = _indexes.try_emplace(object, _sharers.size());
-        if (isNew) {
-            _sharers.push_back({object, {}});
-        }
-        return _sharers[entry->second].processes;
-    }
 
     std::set<int32_t> _displayedPids;
     std::vector<Sharers> _sharers;
-    std::unordered_map<const MWMemoryObject*, size_t> _indexes;
+    tsl::robin_map<const MWMemoryObject*, size_t> _indexes;
     std::unordered_map<const MWMemoryObject*, bool> _containsFakeRegion;
 };
 
 /// One group for each distinct sharer set, filled with its objects.
-std::vector<Group> uniqueGroups(const SharerSets& sharerSets, size_t displayedCount) {
-    constexpr size_t kGroupsPerProcess = 6;
-    GroupSet groups(kGroupsPerProcess * displayedCount);
-    for (const auto& [object, processes] : sharerSets.all()) {
-        auto group = groups.find(processes);
-        if (group == groups.end()) {
-            group = groups.insert(processes.immutableCopy()).first;
+class UniqueGroups {
+public:
+    explicit UniqueGroups(size_t processes) : _groups(kGroupsPerProcess * processes) {}
+
+    void add(const Sharers& sharers) { _groupOf(sharers)->addObject(sharers.object->shared_from_this()); }
+
+    std::vector<Group> all() const {
+        std::vector<Group> groups(_groups.begin(), _groups.end());
+        for (const auto& [process, group] : _ofOne) {
+            groups.push_back(group);
         }
-        (*group)->addObject(object->shared_from_this());
+        return groups;
     }
-    return {groups.begin(), groups.end()};
-}
+
+private:
+    static constexpr size_t kGroupsPerProcess = 6;
+
+    MWProcessGroup* _groupOf(const Sharers& sharers) {
+        if (sharers.all == nullptr) {
+            Group& group = _ofOne[sharers.first];
+            if (group == nullptr) {
+                MWProcessGroupMinimal one;
+                one.addProcess(*sharers.first);
+                group = one.immutableCopy();
+            }
+            return group.get();
+        }
+        auto found = _groups.find(*sharers.all);
+        if (found == _groups.end()) {
+            found = _groups.insert(sharers.all->immutableCopy()).first;
+        }
+        return found->get();
+    }
+
+    GroupSet _groups;  ///< of two or more
+    std::unordered_map<const MWProcess*, Group> _ofOne;
+};
 
 /// By number of members, then by their pids: the report must not depend on a hash table's order.
 bool isReportedBefore(const Group& group, const Group& other) {
@@ -107,7 +150,7 @@ MWProcessToProcessGroups MWMemweight::_generateProcessToProcessGroups() const {
     for (const MWProcess* process : _notHiddenProcesses()) {
         displayedPids.insert(process->pid());
     }
-    SharerSets sharerSets(displayedPids);
+    SharerSets sharerSets(displayedPids, _objectMaps->objectCount());
     for (const auto& process : _processes) {
         mw_enumerateObjectsWithBatchSize(_regionsOf(*process), kRegionsPerSlice,
                                          [&](const std::shared_ptr<MWMemoryRegion>* regions, size_t count) {
@@ -116,7 +159,11 @@ MWProcessToProcessGroups MWMemweight::_generateProcessToProcessGroups() const {
                                              }
                                          });
     }
-    std::vector<Group> groups = uniqueGroups(sharerSets, displayedPids.size());
+    UniqueGroups unique(displayedPids.size());
+    for (const Sharers& sharers : sharerSets.all()) {
+        unique.add(sharers);
+    }
+    std::vector<Group> groups = unique.all();
     std::ranges::sort(groups, isReportedBefore);
     MWProcessToProcessGroups groupsOf;
     for (const Group& group : groups) {

@@ -32,11 +32,11 @@ void MWMemweight::printOutputVerbose(OutputForm form) {
     if (form.verbose) {
         printSpanlistLikeOutputForProcesses(processes);
     }
-    // Holds the objects until the summary has been printed.
-    const MWProcessToProcessGroups groupsOf = _generateProcessToProcessGroups();
+    // The groups hold the objects from here on.
+    _groupsOf = _generateProcessToProcessGroups();
     _objectMaps.reset();
     for (const MWProcess* process : processes) {
-        _printProcess(*process, groupsOf, form.summarize);
+        _printProcess(*process, form.summarize);
     }
     _printSummary(processes, form.summarize);
 }
@@ -49,12 +49,11 @@ void MWMemweight::printSpanlistLikeOutputForProcesses(const MWProcessOrder& proc
     }
 }
 
-void MWMemweight::_printProcess(const MWProcess& process, const MWProcessToProcessGroups& groupsOf,
-                                bool summarize) const {
+void MWMemweight::_printProcess(const MWProcess& process, bool summarize) const {
     const bool hasErrors = !process.errors().empty();
     _printProcessHead(process, hasErrors);
-    const auto groups = groupsOf.find(process.asNumber());
-    if (hasErrors || groups == groupsOf.end()) {
+    const auto groups = _groupsOf.find(process.asNumber());
+    if (hasErrors || groups == _groupsOf.end()) {
         for (MWOutputFormatter* formatter : _outputFormatters) {
             formatter->printProcessCategories(MWCategoryTable(), MWCategoryTotals());
         }

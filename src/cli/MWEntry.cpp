@@ -111,31 +111,34 @@ void gatherAndAnalyze(MWMemweight& memweight) {
     memweight.analyzeData();
 }
 
-void measure(const MWMemweightArgs& args, const MWTargetMap& targets, const Formatters& formatters) {
+/// Answers the measurement, which still holds everything that was gathered.
+std::unique_ptr<MWMemweight> measure(const MWMemweightArgs& args, const MWTargetMap& targets,
+                                     const Formatters& formatters) {
     std::vector<std::shared_ptr<MWProcess>> processes;
     processes.reserve(targets.size());
     for (const auto& [pid, process] : targets) {
         processes.push_back(process);
     }
-    MWMemweight memweight(std::move(processes));
-    gatherAndAnalyze(memweight);
+    auto memweight = std::make_unique<MWMemweight>(std::move(processes));
+    gatherAndAnalyze(*memweight);
     for (const auto& formatter : formatters) {
-        memweight.addOutputFormatter(*formatter);
+        memweight->addOutputFormatter(*formatter);
     }
-    memweight.printOutputVerbose({.verbose = args.spanlistLikeOutput(), .summarize = args.summarize()});
+    memweight->printOutputVerbose({.verbose = args.spanlistLikeOutput(), .summarize = args.summarize()});
+    return memweight;
 }
 
 }  // namespace
 
-int MWMemweightMain(int argc, char* const argv[]) {
+int MWMemweightMain(int argc, char* const argv[], MWKeptUntilExit* kept) {
     auto args = MWMemweightArgs::initWithArgc(argc, argv);
     if (!args) {
         return rejectArguments(args.error());
     }
-    return MWRunMemweight(*args);
+    return MWRunMemweight(*args, kept);
 }
 
-int MWRunMemweight(MWMemweightArgs& args) {
+int MWRunMemweight(MWMemweightArgs& args, MWKeptUntilExit* kept) {
     // Before the formatters are made: a document records the mode when it is opened.
     if (args.shouldGetPhysMemweightBreakdown()) {
         MWMemweight::setBreakDownPhysMemweight(true);
@@ -158,7 +161,10 @@ int MWRunMemweight(MWMemweightArgs& args) {
         targets.reset();  // they do exist: each sample resolves them anew
         succeeded = MWSampling(args, *formatters).run();
     } else {
-        measure(args, *targets, *formatters);
+        std::shared_ptr<MWMemweight> measurement = measure(args, *targets, *formatters);
+        if (kept != nullptr) {
+            *kept = std::move(measurement);
+        }
     }
     for (const auto& formatter : *formatters) {
         formatter->close();

@@ -4,7 +4,9 @@
 
 int main(int argc, char* argv[]) {
     MWPrepareProgram();
-    MWLinuxHost host;
+    // Neither is ever destroyed, see MWKeptUntilExit.
+    static auto& host = *new MWLinuxHost;
+    static auto& kept = *new MWKeptUntilExit;
     MWHostInterface::setCurrent(&host);
-    return MWMemweightMain(argc, argv);
+    return MWMemweightMain(argc, argv, &kept);
 }

@@ -5,6 +5,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "output/MWDateFormatter.h"
@@ -62,30 +63,34 @@ public:
     std::string formattedStringForSize(uint64_t size) const;
     /// "/usr/lib/libx.so" as ".../libx.so", unless full paths are on; otherwise unchanged.
     std::optional<std::string> _truncatedNameForString(const std::optional<std::string>& string) const;
-    /// The table's keys in report order; rows that are equal in every compared value stand in order of key.
-    std::vector<std::string> _sortedKeysForCategories(const MWCategoryTable& categories) const;
+    /// The table's rows in report order; rows that are equal in every compared value stand in order of key.
+    std::vector<const MWCategoryTable::value_type*> _sortedKeysForCategories(
+        const MWCategoryTable& categories) const;
 
 private:
     /// One text for each size column that can be shown.
     struct SizeTexts {
-        std::string dirty;
-        std::string swapped;
-        std::string clean;
-        std::string reclaimable;
-        std::string wired;
+        std::string_view dirty;
+        std::string_view swapped;
+        std::string_view clean;
+        std::string_view reclaimable;
+        std::string_view wired;
     };
 
     /// Rounded up; 0 where the page size is not known.
     static uint64_t _pagesForSize(uint64_t size, uint64_t pageSize);
 
     bool _shows(MWTextOptions option) const { return (_options & option) != 0; }
-    std::string _sizeColumns(const SizeTexts& texts) const;
     void _printTable(const MWCategoryTable& categories, const MWCategoryTotals& total) const;
-    void _printTableHeader() const;
-    void _printDashes() const;
-    void _printCategories(const MWCategoryTable& categories) const;
-    void _printTotalFooter(const MWCategoryTotals& total) const;
-    void _printRow(const MWCategoryTotals& total, std::string_view category, std::string_view detail) const;
+    void _appendSizeColumns(std::string& line, const SizeTexts& texts) const;
+    std::string _headerLine() const;
+    std::string _dashesLine() const;
+    void _appendCategory(std::string& table, const std::string& key, const MWMemoryCategory& category) const;
+    void _appendRow(std::string& table, const MWCategoryTotals& total, std::string_view category,
+                    std::string_view detail) const;
+    /// Valid until the next call of _makeRoomForSizeTexts.
+    const std::string& _sizeText(uint64_t size) const;
+    void _makeRoomForSizeTexts() const;
 
     std::string _spanlistHeader() const;
     std::string _spanlistRow(const MWMemoryRegion& region, uint64_t pageSize) const;
@@ -113,4 +118,7 @@ private:
     MWTextOptions _options;
     std::string _sort;
     std::FILE* _output;
+    // Texts that have been made before.
+    mutable std::unordered_map<uint64_t, std::string> _sizeTexts;
+    mutable uint64_t _sizeTextsPageSize = 0;
 };

@@ -1,11 +1,13 @@
 // The category tables of the text report: sizes, columns and the order of the rows.
 
 #include <bsd/stdlib.h>
+#include <fmt/format.h>
 #include <fmt/printf.h>
 
 #include <algorithm>
 #include <array>
 #include <cstddef>
+#include <cstdio>
 
 #include "output/MWOutputFormatterText.h"
 #include "platform/MWInvariant.h"
@@ -23,12 +25,17 @@ std::string humanized(uint64_t size) {
 }
 
 struct ColumnWidths {
-    int dirty;
-    int swapped;
-    int clean;
-    int reclaimable;
-    int wired;
+    size_t dirty;
+    size_t swapped;
+    size_t clean;
+    size_t reclaimable;
+    size_t wired;
 };
+constexpr size_t kRegionsWidth = 11;
+
+void appendRight(std::string& line, std::string_view text, size_t width) {
+    line.append(width - std::min(width, text.size()), ' ').append(text);
+}
 
 ColumnWidths columnWidths(MWSummaryFormat format) {
     if (format == MWSummaryFormat::formatted) {
@@ -117,79 +124,108 @@ std::optional<std::string> MWOutputFormatterText::_truncatedNameForString(
     return component.size() == string->size() ? string : ".../" + component;
 }
 
-std::vector<std::string> MWOutputFormatterText::_sortedKeysForCategories(
+std::vector<const MWCategoryTable::value_type*> MWOutputFormatterText::_sortedKeysForCategories(
     const MWCategoryTable& categories) const {
     const auto* const column = std::ranges::find(kSortColumns, _sort, &SortColumn::name);
     MW_INVARIANT(column != kSortColumns.end(), "Unhandled text sort column");
-    std::vector<std::string> keys;
-    keys.reserve(categories.size());
-    for (const auto& [key, category] : categories) {
-        keys.push_back(key);
+    std::vector<const MWCategoryTable::value_type*> rows;
+    rows.reserve(categories.size());
+    for (const auto& row : categories) {
+        rows.push_back(&row);
     }
     if (column->rank != nullptr) {
-        std::ranges::stable_sort(keys, std::ranges::greater(),
-                                 [&](const std::string& key) { return column->rank(categories.at(key)); });
+        std::ranges::stable_sort(rows, std::ranges::greater(),
+                                 [&](const auto* row) { return column->rank(row->second); });
     }
-    return keys;
+    return rows;
 }
 
 void MWOutputFormatterText::_printTable(const MWCategoryTable& categories,
                                         const MWCategoryTotals& total) const {
-    _printTableHeader();
-    _printDashes();
-    _printCategories(categories);
-    _printTotalFooter(total);
+    std::string table = _headerLine();
+    const std::string dashes = _dashesLine();
+    table += dashes;
+    for (const auto* row : _sortedKeysForCategories(categories)) {
+        _appendCategory(table, row->first, row->second);
+    }
+    table += dashes;
+    _appendRow(table, total, "TOTAL", "");
+    std::fwrite(table.data(), 1, table.size(), _output);
 }
 
 /// The size columns side by side; those that are not shown take no room.
-std::string MWOutputFormatterText::_sizeColumns(const SizeTexts& texts) const {
+void MWOutputFormatterText::_appendSizeColumns(std::string& line, const SizeTexts& texts) const {
     const ColumnWidths widths = columnWidths(_summaryFormat);
-    const bool swapped = _swappedColumnName.has_value();
-    const bool wired = _wiredColumnName.has_value();
-    return fmt::sprintf("%*s%*s%*s%*s%*s", widths.dirty, texts.dirty, swapped ? widths.swapped : 0,
-                        swapped ? texts.swapped : "", widths.clean, texts.clean, widths.reclaimable,
-                        texts.reclaimable, wired ? widths.wired : 0, wired ? texts.wired : "");
-}
-
-void MWOutputFormatterText::_printTableHeader() const {
-    const SizeTexts names = {.dirty = "Dirty",
-                             .swapped = _swappedColumnName.value_or(""),
-                             .clean = "Clean",
-                             .reclaimable = "Reclaimable",
-                             .wired = _wiredColumnName.value_or("")};
-    fmt::fprintf(_output, "%s %10s    %s\n", _sizeColumns(names), "Regions", "Category");
-}
-
-void MWOutputFormatterText::_printDashes() const {
-    const SizeTexts dashes = {
-        .dirty = "---", .swapped = "---", .clean = "---", .reclaimable = "---", .wired = "---"};
-    fmt::fprintf(_output, "%s %10s    %s\n", _sizeColumns(dashes), "---", "---");
-}
-
-void MWOutputFormatterText::_printCategories(const MWCategoryTable& categories) const {
-    for (const std::string& key : _sortedKeysForCategories(categories)) {
-        const MWMemoryCategory& category = categories.at(key);
-        const bool isNamed = category.firstMemoryObject() != nullptr;
-        if (isNamed && category.verbose() && !_verbose) {
-            continue;
-        }
-        const auto detail = isNamed ? _truncatedNameForString(category.detailedName()) : std::nullopt;
-        _printRow(totalsOfCategory(category), isNamed ? category.name() : key, detail ? " " + *detail : "");
+    appendRight(line, texts.dirty, widths.dirty);
+    if (_swappedColumnName) {
+        appendRight(line, texts.swapped, widths.swapped);
+    }
+    appendRight(line, texts.clean, widths.clean);
+    appendRight(line, texts.reclaimable, widths.reclaimable);
+    if (_wiredColumnName) {
+        appendRight(line, texts.wired, widths.wired);
     }
 }
 
-void MWOutputFormatterText::_printTotalFooter(const MWCategoryTotals& total) const {
-    _printDashes();
-    _printRow(total, "TOTAL", "");
+std::string MWOutputFormatterText::_headerLine() const {
+    std::string line;
+    _appendSizeColumns(line, {.dirty = "Dirty",
+                              .swapped = _swappedColumnName.value_or(""),
+                              .clean = "Clean",
+                              .reclaimable = "Reclaimable",
+                              .wired = _wiredColumnName.value_or("")});
+    appendRight(line, "Regions", kRegionsWidth);
+    return line += "    Category\n";
 }
 
-void MWOutputFormatterText::_printRow(const MWCategoryTotals& total, std::string_view category,
-                                      std::string_view detail) const {
-    const SizeTexts sizes = {.dirty = formattedStringForSize(total.dirty + total.swapped),
-                             .swapped = formattedStringForSize(total.swapped),
-                             .clean = formattedStringForSize(total.clean),
-                             .reclaimable = formattedStringForSize(total.reclaimable),
-                             .wired = formattedStringForSize(total.wired)};
-    fmt::fprintf(_output, "%s %10d    %s%s\n", _sizeColumns(sizes), total.regions, MWTerminalText(category),
-                 MWTerminalText(detail));
+std::string MWOutputFormatterText::_dashesLine() const {
+    constexpr std::string_view kDashes = "---";
+    std::string line;
+    _appendSizeColumns(
+        line,
+        {.dirty = kDashes, .swapped = kDashes, .clean = kDashes, .reclaimable = kDashes, .wired = kDashes});
+    appendRight(line, kDashes, kRegionsWidth);
+    return line += "    ---\n";
+}
+
+void MWOutputFormatterText::_appendCategory(std::string& table, const std::string& key,
+                                            const MWMemoryCategory& category) const {
+    const bool isNamed = category.firstMemoryObject() != nullptr;
+    if (isNamed && category.verbose() && !_verbose) {
+        return;
+    }
+    const auto detail = isNamed ? _truncatedNameForString(category.detailedName()) : std::nullopt;
+    _appendRow(table, totalsOfCategory(category), isNamed ? category.name() : key,
+               detail ? " " + *detail : "");
+}
+
+void MWOutputFormatterText::_appendRow(std::string& table, const MWCategoryTotals& total,
+                                       std::string_view category, std::string_view detail) const {
+    _makeRoomForSizeTexts();
+    _appendSizeColumns(table, {.dirty = _sizeText(total.dirty + total.swapped),
+                               .swapped = _sizeText(total.swapped),
+                               .clean = _sizeText(total.clean),
+                               .reclaimable = _sizeText(total.reclaimable),
+                               .wired = _sizeText(total.wired)});
+    appendRight(table, fmt::format_int(static_cast<int32_t>(total.regions)).c_str(), kRegionsWidth);
+    table.append("    ").append(MWTerminalText(category)).append(MWTerminalText(detail)) += '\n';
+}
+
+// Most sizes of a report are few and small, and are written many times over. In pages one size has another
+// text for each page size.
+void MWOutputFormatterText::_makeRoomForSizeTexts() const {
+    constexpr size_t kMostTexts = 4096;
+    constexpr size_t kTextsOfARow = 5;
+    if (_sizeTexts.size() + kTextsOfARow > kMostTexts || _sizeTextsPageSize != _pageSize) {
+        _sizeTexts.clear();
+        _sizeTextsPageSize = _pageSize;
+    }
+}
+
+const std::string& MWOutputFormatterText::_sizeText(uint64_t size) const {
+    std::string& text = _sizeTexts[size];
+    if (text.empty()) {
+        text = formattedStringForSize(size);
+    }
+    return text;
 }

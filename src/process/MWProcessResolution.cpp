@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <charconv>
 #include <cstddef>
+#include <functional>
 #include <memory>
 #include <new>
 #include <string_view>
@@ -10,6 +11,7 @@
 #include <unordered_set>
 
 #include "platform/MWHostInterface.h"
+#include "platform/MWWorkQueue.h"
 #include "process/MWKernelProcess.h"
 #include "process/MWProcess.h"
 #include "process/MWUserProcess.h"
@@ -44,17 +46,31 @@ std::optional<proc_bsdinfo> recordOfPid(int32_t pid) {
     return info;
 }
 
+/// Calls `work` with 0 ... count - 1, on all processors where there is enough to do.
+void forEachIndex(size_t count, const std::function<void(size_t)>& work) {
+    constexpr size_t kWorthThreads = 64;
+    if (count >= kWorthThreads) {
+        MWConcurrentQueue("org.memweight.memweight.processes", QOS_CLASS_UTILITY).apply(count, work);
+        return;
+    }
+    for (size_t index = 0; index < count; ++index) {
+        work(index);
+    }
+}
+
 /// Every process there is now, in the order of the system's list; none when there is no telling.
 std::optional<ProcessSnapshot> takeSnapshot() {
     const auto pids = listAllPids();
     if (!pids) {
         return std::nullopt;
     }
+    std::vector<std::optional<proc_bsdinfo>> records(pids->size());
+    forEachIndex(pids->size(), [&](size_t index) { records[index] = recordOfPid((*pids)[index]); });
     ProcessSnapshot snapshot;
     snapshot.reserve(pids->size());
-    for (const int32_t pid : *pids) {
-        if (const auto info = recordOfPid(pid)) {
-            snapshot.push_back(*info);
+    for (const auto& record : records) {
+        if (record) {
+            snapshot.push_back(*record);
         }
     }
     return snapshot.empty() ? std::nullopt : std::optional(std::move(snapshot));
@@ -217,12 +233,16 @@ std::optional<MWTargetMap> MWProcess::allProcessesExcludingPids(const std::set<i
     if (!snapshot) {
         return std::nullopt;
     }
-    MWTargetMap processes;
-    for (const proc_bsdinfo& info : *snapshot) {
-        if (excludedPids.contains(pidOf(info))) {
-            continue;
+    std::vector<std::shared_ptr<MWProcess>> made(snapshot->size());
+    forEachIndex(snapshot->size(), [&](size_t index) {
+        const proc_bsdinfo& info = (*snapshot)[index];
+        if (!excludedPids.contains(pidOf(info))) {
+            made[index] = processWithBsdInfo(info);
         }
-        if (auto process = processWithBsdInfo(info)) {
+    });
+    MWTargetMap processes;
+    for (auto& process : made) {
+        if (process != nullptr) {
             processes[process->asNumber()] = std::move(process);
         }
     }

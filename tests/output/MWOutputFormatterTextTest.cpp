@@ -116,8 +116,8 @@ TEST(MWOutputFormatterText, RowsAreSortedByTheColumnAndThenByKey) {
     const auto order = [&](const char* sort) {
         const MWTextStyle style = {.summaryFormat = MWSummaryFormat::bytes, .options = 0, .sort = sort};
         std::string keys;
-        for (const std::string& key : MWOutputFormatterText(style)._sortedKeysForCategories(table)) {
-            keys += key;
+        for (const auto* row : MWOutputFormatterText(style)._sortedKeysForCategories(table)) {
+            keys += row->first;
         }
         return keys;
     };

@@ -9,8 +9,6 @@ namespace {
 
 using procfs::Vma;
 
-constexpr std::string_view kSysVPath = "/SYSV";
-
 bool startsWithAny(std::string_view text, std::initializer_list<std::string_view> prefixes) {
     return std::any_of(prefixes.begin(), prefixes.end(),
                        [&](auto prefix) { return text.starts_with(prefix); });
@@ -75,7 +73,7 @@ ObjectPlace placeOf(const BackedVma& backed, const AddressSpaceOwner& owner, con
     if (backed.backing == Backing::anonymous || hasOwnPages(vma)) {
         return own;
     }
-    if (vma.path.starts_with(kSysVPath)) {
+    if (isSysVSegment(vma)) {
         return {identity.sysV(vma.device(), vma.inode, owner.ipcNamespace), vma.offset};
     }
     if (hasInodeOfItsOwn(vma) || vma.path.starts_with("[anon_shmem:")) {
@@ -311,6 +309,10 @@ private:
 
 }  // namespace
 
+bool isSysVSegment(const Vma& vma) {
+    return vma.path.starts_with("/SYSV");
+}
+
 Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirectory) {
     const std::string_view path = vma.path;
     if (vma.has(procfs::VmFlagHugetlb)) {
@@ -324,8 +326,7 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
         (path == "/dev/zero" && !vma.shared)) {
         return Backing::anonymous;
     }
-    // SysV segments are told by their path, never by inode 0: their inode is the segment's id.
-    if (startsWithAny(path, {kSysVPath, "/memfd:", "[anon_shmem:", "/secretmem"})) {
+    if (isSysVSegment(vma) || startsWithAny(path, {"/memfd:", "[anon_shmem:", "/secretmem"})) {
         return Backing::shmem;
     }
     if (!path.starts_with('/')) {

@@ -74,6 +74,9 @@ private:
     uint64_t _partOfFamilyMemory = 0;
 };
 
+/// Whether it maps a SysV segment, which only its path tells, never inode 0: its inode is the segment's id.
+bool isSysVSegment(const procfs::Vma& vma);
+
 /// The mappings with what backs them; see backingOf.
 std::vector<BackedVma> backedVmas(std::vector<procfs::Vma> vmas, ShmemDevices& shmemDevices,
                                   int processDirectory);

@@ -11,18 +11,18 @@ namespace {
 
 // Of a process whose first thread has ended, those of one that lives. Kernel threads have none.
 std::optional<uint64_t> identifierOf(int processDirectory, int32_t pid, const ObjectIdentity& identity) {
-    if (const auto identifier = randomBytesIdentifier(processDirectory, pid, identity)) {
-        return identifier;
-    }
     std::string text;
+    if (procfs::readRecord(processDirectory, "auxv", text) && !text.empty()) {
+        return randomBytesIdentifier(text, pid, identity);
+    }
     const auto stat =
         procfs::readRecord(processDirectory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
     if (!stat || !stat->threadEnded()) {
         return std::nullopt;
     }
     const LiveThread thread = openLiveThread(processDirectory);
-    return thread.directory ? randomBytesIdentifier(thread.directory.get(), thread.identifier, identity)
-                            : std::nullopt;
+    procfs::readRecord(thread.directory.get(), "auxv", text);
+    return randomBytesIdentifier(text, thread.identifier, identity);
 }
 
 }  // namespace

@@ -80,10 +80,8 @@ std::optional<uint64_t> randomBytesAddress(std::string_view auxv) {
                     : findAuxiliaryValue<uint32_t>(auxv, AT_RANDOM);
 }
 
-std::optional<uint64_t> randomBytesIdentifier(int processDirectory, int32_t pid,
+std::optional<uint64_t> randomBytesIdentifier(std::string_view auxv, int32_t pid,
                                               const ObjectIdentity& identity) {
-    std::string auxv;
-    procfs::readRecord(processDirectory, "auxv", auxv);
     const auto bytes = readRandomBytes(pid, auxv);
     return bytes ? std::optional(identity.bytes({bytes->data(), bytes->size()})) : std::nullopt;
 }
@@ -92,8 +90,8 @@ uint64_t forkFamilyIdentifier(int procDirectory, int processDirectory, int32_t p
                               const ObjectIdentity& identity) {
     std::string auxv;
     procfs::readRecord(processDirectory, "auxv", auxv);
-    if (const auto bytes = readRandomBytes(pid, auxv)) {
-        return identity.bytes({bytes->data(), bytes->size()});
+    if (const auto identifier = randomBytesIdentifier(auxv, pid, identity)) {
+        return *identifier;
     }
     const std::optional<uint64_t> stackAddress = randomBytesAddress(auxv);
     if (stackAddress && hasRandomAddresses(*stackAddress)) {

@@ -54,8 +54,9 @@ private:
 uint64_t forkFamilyIdentifier(int procDirectory, int processDirectory, int32_t pid,
                               const ObjectIdentity& identity);
 
-/// The same by the random bytes alone; none where they cannot be read.
-std::optional<uint64_t> randomBytesIdentifier(int processDirectory, int32_t pid,
+/// The same by the random bytes alone, which the text of `auxv` says where to find; none where they cannot be
+/// read.
+std::optional<uint64_t> randomBytesIdentifier(std::string_view auxv, int32_t pid,
                                               const ObjectIdentity& identity);
 
 /// The address of the random bytes in the text of `auxv`.

@@ -71,7 +71,8 @@ private:
             _addDrmClient(number, MWLedgerNeural);
         } else if (target.starts_with("/dmabuf:")) {
             _addDmaBuffer(directory, number);
-        } else if (target.starts_with("/memfd:") || (target.starts_with('/') && _mounts().hold(target))) {
+        } else if (target.starts_with("/memfd:") || (target.starts_with('/') && _mounts().hold(target) &&
+                                                     !_scan.targets.isOtherNode(_knownMounts, _target))) {
             _addFile(directory, number);
         }
     }
@@ -121,6 +122,9 @@ private:
     void _addFile(int directory, const char* number) {
         const auto file = _status(directory, number);
         constexpr uint64_t kBlock = 512;
+        if (file && !S_ISREG(file->stx_mode)) {
+            _scan.targets.addOtherNode(_knownMounts, _target);
+        }
         if (!file || !S_ISREG(file->stx_mode) || file->stx_blocks == 0) {
             return;
         }
@@ -203,6 +207,21 @@ std::shared_ptr<const MemoryMounts> DescriptorTargets::mountsOf(int processDirec
         _mounts.emplace(key, mounts);
     }
     return mounts;
+}
+
+bool DescriptorTargets::isOtherNode(const std::shared_ptr<const MemoryMounts>& mounts,
+                                    const std::string& path) const {
+    const std::lock_guard lock(_mutex);
+    return _otherNodes.contains({mounts, path});
+}
+
+// The path of a node that has been removed says so, and can belong to several.
+void DescriptorTargets::addOtherNode(const std::shared_ptr<const MemoryMounts>& mounts,
+                                     const std::string& path) {
+    if (mounts != nullptr && !path.ends_with(" (deleted)")) {
+        const std::lock_guard lock(_mutex);
+        _otherNodes.emplace(mounts, path);
+    }
 }
 
 SocketMemory* DescriptorTargets::_socketsOf(uint64_t networkNamespace, int processDirectory) {

@@ -4,6 +4,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -38,6 +39,10 @@ public:
 
     /// Of the mount namespace of the process with this directory, by the paths that its links have.
     std::shared_ptr<const MemoryMounts> mountsOf(int processDirectory);
+    /// Whether the path has been seen to lead to something else than a file: every process has its terminal
+    /// or /dev/null open several times.
+    bool isOtherNode(const std::shared_ptr<const MemoryMounts>& mounts, const std::string& path) const;
+    void addOtherNode(const std::shared_ptr<const MemoryMounts>& mounts, const std::string& path);
     struct Socket {
         uint64_t inode;
         uint64_t networkNamespace;  ///< in which the process is
@@ -55,8 +60,9 @@ private:
     SocketMemory* _socketsOf(uint64_t networkNamespace, int processDirectory);
 
     const ShmemDevices& _devices;
-    std::mutex _mutex;
+    mutable std::mutex _mutex;
     std::map<std::pair<uint64_t, std::string>, std::shared_ptr<const MemoryMounts>> _mounts;
+    std::set<std::pair<std::shared_ptr<const MemoryMounts>, std::string>> _otherNodes;
     std::map<uint64_t, std::unique_ptr<SocketMemory>> _sockets;  ///< by network namespace
     bool _triedOwnNamespace = false;                             ///< the tool's
 };

@@ -59,12 +59,18 @@ mach_memory_info_t recordOf(MWSiteType type, uint64_t site, uint64_t bytes) {
     return record;
 }
 
-uint64_t pageTablesOfProcesses(int procDirectory) {
+uint64_t pageTablesOfProcesses(int procDirectory, const PageTables& known) {
     uint64_t sum = 0;
     std::string text;
     procfs::forEachEntry(procDirectory, ".", [&](int processes, const char* name) {
-        if (*name >= '1' && *name <= '9' &&
-            procfs::readFile(processes, (std::string(name) + "/status").c_str(), text)) {
+        std::string_view number = name;
+        int32_t pid = 0;
+        if (!procfs::takeNumber(number, pid)) {
+            return true;
+        }
+        if (const auto bytes = known.of(pid)) {
+            sum = MWSaturatingAdd(sum, *bytes);
+        } else if (procfs::readRecord(processes, (std::string(name) + "/status").c_str(), text)) {
             sum = MWSaturatingAdd(sum, procfs::parseStatus(text).vmPte);
         }
         return true;
@@ -311,7 +317,8 @@ private:
     // Processes are charged for their own, but not for the topmost level of each and not for the kernel's.
     void _addPageTables() {
         const uint64_t all = _meminfo["PageTables"];
-        const uint64_t charged = all == 0 ? 0 : std::min(all, pageTablesOfProcesses(_sources.procDirectory));
+        const uint64_t charged =
+            all == 0 ? 0 : std::min(all, pageTablesOfProcesses(_sources.procDirectory, _sources.pageTables));
         _addTag(MWKernelTagPageTables, charged, MWSiteHidden);
         _addTag(MWKernelTagPageTables, all - charged);
     }

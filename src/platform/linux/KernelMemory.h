@@ -7,12 +7,14 @@
 
 #include "platform/MWHostInterface.h"
 #include "platform/linux/KernelSymbols.h"
+#include "platform/linux/PageTables.h"
 
 /// Where the kernel tells of its memory.
 struct KernelMemorySources {
     int procDirectory;
     int sysDirectory;  ///< -1 when there is no sysfs
     uint64_t pageSize;
+    const PageTables& pageTables;  ///< of processes that need not be asked again
 };
 
 /// The kernel's memory as records, no page in two of them.

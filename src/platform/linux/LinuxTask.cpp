@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <ctime>
 #include <string>
 #include <unordered_set>
 #include <utility>
@@ -32,6 +33,22 @@ std::string bootId(int procDirectory) {
     std::string text;
     procfs::readFile(procDirectory, "sys/kernel/random/boot_id", text);
     return text;
+}
+
+uint64_t monotonicNanoseconds() {
+    constexpr uint64_t kNanosecondsPerSecond = 1'000'000'000;
+    timespec time = {};
+    clock_gettime(CLOCK_MONOTONIC_COARSE, &time);
+    return static_cast<uint64_t>(time.tv_sec) * kNanosecondsPerSecond + static_cast<uint64_t>(time.tv_nsec);
+}
+
+uint64_t programOf(int memoryDirectory, const ObjectIdentity& identity) {
+    std::string auxv;
+    return procfs::readRecord(memoryDirectory, "auxv", auxv) && !auxv.empty() ? identity.bytes(auxv) : 0;
+}
+
+bool hasSysVSegments(const std::vector<BackedVma>& vmas) {
+    return std::ranges::any_of(vmas, [](const BackedVma& backed) { return isSysVSegment(backed.vma); });
 }
 
 // Whether the kernel lets the caller look at the memory. Of a process that has ended there is none to look
@@ -89,10 +106,21 @@ std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
     task->_startTime = stat->startTime;
     task->_stat = *stat;
     task->_chooseThread();
-    return mayLook(task->memoryDirectory()) ? std::move(task) : nullptr;
+    // Whoever may read auxv may read maps.
+    std::string auxv;
+    const bool read = procfs::readRecord(task->memoryDirectory(), "auxv", auxv) && !auxv.empty();
+    if (!read && !mayLook(task->memoryDirectory())) {
+        return nullptr;
+    }
+    task->_program = read ? run.identity.bytes(auxv) : 0;
+    if (run.mappingSource == MappingSource::cheapest) {
+        task->_exec = randomBytesIdentifier(auxv, task->_threadId, run.identity);
+    }
+    return task;
 }
 
 LinuxTask::~LinuxTask() {
+    _run.pageTables.forget(_pid);
     _run.sharedSpaces.forget({_pid, _startTime});
 }
 
@@ -117,13 +145,23 @@ kern_return_t LinuxTask::_readMappings(Mappings& mappings) {
         if (!read && errno != ESRCH) {
             return KERN_FAILURE;
         }
-        const procfs::ProcStat before = std::move(_stat);
-        _stat = readStat(memoryDirectory()).value_or(endedThread());
-        if (read && !_stat.threadEnded() && _stat.isSameProgramAs(before)) {
+        if (_runsTheSame() && read) {
             return mappings.vmas.empty() ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
         }
     }
     return MACH_SEND_INVALID_DEST;
+}
+
+// Whether the thread lives and has not run another program since it was last looked at. Both show in auxv
+// first, which costs less than half of `stat`.
+bool LinuxTask::_runsTheSame() {
+    if (_program != 0 && programOf(memoryDirectory(), _run.identity) == _program) {
+        return true;
+    }
+    const procfs::ProcStat before = std::move(_stat);
+    _stat = readStat(memoryDirectory()).value_or(endedThread());
+    _program = programOf(memoryDirectory(), _run.identity);
+    return !_stat.threadEnded() && _stat.isSameProgramAs(before);
 }
 
 // Looking at the whole system for what smaps would tell pays off where much is measured.
@@ -140,8 +178,8 @@ bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
     _pages.emplace(directory, PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
     mappings = {};
     std::vector<procfs::Vma> vmas;
-    const auto status = _readStatus();
-    if (status && _countsPayOff(*status)) {
+    const auto current = status();
+    if (current && _countsPayOff(*current)) {
         if (!procfs::readMappings(directory, "maps", vmas)) {
             return false;
         }
@@ -151,7 +189,7 @@ bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
         mappings.counts = countWithoutSmaps(mappings.vmas,
                                             {.pid = _pid,
                                              .memoryDirectory = directory,
-                                             .status = *status,
+                                             .status = *current,
                                              .scan = scan,
                                              .pages = *_pages,
                                              .pageSize = _run.pageSize},
@@ -167,23 +205,19 @@ bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
     return true;
 }
 
-std::optional<procfs::ProcStatus> LinuxTask::_readStatus() {
-    std::string text;
-    const bool read = procfs::readRecord(memoryDirectory(), "status", text);
-    _statusAtHand = read ? std::optional(procfs::parseStatus(text)) : std::nullopt;
-    _statusServes = StatusUse::charge;
-    return _statusAtHand;
-}
-
-std::optional<procfs::ProcStatus> LinuxTask::status(StatusUse use) {
-    if (!_statusAtHand || _statusServes != use) {
-        _readStatus();
+std::optional<procfs::ProcStatus> LinuxTask::status() {
+    constexpr uint64_t kLongestLife = 50'000'000;
+    const uint64_t now = monotonicNanoseconds();
+    if (!_status || now - _statusTime > kLongestLife) {
+        std::string text;
+        const bool read = procfs::readRecord(memoryDirectory(), "status", text);
+        _status = read ? std::optional(procfs::parseStatus(text)) : std::nullopt;
+        _statusTime = now;
+        if (_status) {
+            _run.pageTables.set(_pid, _status->vmPte);
+        }
     }
-    if (use == StatusUse::charge && _statusAtHand) {
-        _statusServes = StatusUse::pageTables;
-        return _statusAtHand;
-    }
-    return std::exchange(_statusAtHand, std::nullopt);
+    return _status;
 }
 
 ForkFamily& LinuxTask::_family() {
@@ -214,7 +248,9 @@ kern_return_t LinuxTask::takeSnapshot() {
         std::move(mappings.vmas),
         AddressSpaceOwner{.pid = owner.pid,
                           .startTime = owner.startTime,
-                          .ipcNamespace = procfs::readNamespace(memoryDirectory(), "ipc"),
+                          .ipcNamespace = hasSysVSegments(mappings.vmas)
+                                              ? procfs::readNamespace(memoryDirectory(), "ipc")
+                                              : 0,
                           .family = [&]() -> ForkFamily& { return isAlone ? _noFamily : _family(); }},
         pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
     if (owner.pid == _pid) {
@@ -248,7 +284,7 @@ bool LinuxTask::sharesAnothersSpace() {
 void LinuxTask::survey() {
     _surveyOwnedObjects();
     if (_run.mappingSource == MappingSource::cheapest) {
-        _run.forkCensus.add(_pid, randomBytesIdentifier(memoryDirectory(), _threadId, _run.identity));
+        _run.forkCensus.add(_pid, _exec);
     }
 }
 

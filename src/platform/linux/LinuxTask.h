@@ -16,6 +16,7 @@
 #include "platform/linux/MappingCounts.h"
 #include "platform/linux/OwnedObjectSurvey.h"
 #include "platform/linux/PageDispositions.h"
+#include "platform/linux/PageTables.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
 #include "platform/linux/SharedAddressSpaces.h"
@@ -24,8 +25,7 @@
 /// Where the counts of a mapping come from.
 enum class MappingSource : uint8_t {
     smaps,     ///< with everything that it tells
-    cheapest,  ///< the figures are the same; what no report shows (the protections that a mapping may have)
-               ///< is not
+    cheapest,  ///< the same figures; the protections that a mapping may have are not known
 };
 
 /// What all the tasks of a run share.
@@ -42,6 +42,7 @@ struct LinuxRun {
     OwnedObjectSurvey ownedObjects;
     UncountedPages uncountedPages;
     ForkCensus forkCensus;
+    PageTables pageTables;
     PageFrameFlags frames;
     PagemapEntry untouchedPage;  ///< of this process, to know the zero page by
     MappingSource mappingSource;
@@ -92,10 +93,9 @@ public:
     /// snapshot. KERN_INVALID_ARGUMENT when the process has ended.
     kern_return_t fillDispositions(uint64_t start, std::span<int32_t> words);
 
-    /// `status`, as fresh as the last question about memory: the charge and the page tables of one process
-    /// are asked for together, and the charge again after a snapshot. None when the process is gone.
-    enum class StatusUse : uint8_t { charge, pageTables };
-    std::optional<procfs::ProcStatus> status(StatusUse use);
+    /// `status`, at most 50 ms old: several questions about one process come together. None when the process
+    /// is gone.
+    std::optional<procfs::ProcStatus> status();
 
     /// Whether its memory goes under another process's name, with which it shares one address space.
     bool sharesAnothersSpace();
@@ -119,7 +119,7 @@ private:
     kern_return_t _readMappings(Mappings& mappings);
     bool _readMappingsOnce(Mappings& mappings);
     bool _countsPayOff(const procfs::ProcStatus& status) const;
-    std::optional<procfs::ProcStatus> _readStatus();
+    bool _runsTheSame();
     std::unordered_set<uint64_t> _shownObjects();
     bool _readEntries(const AddressSpaceRegion& region, uint64_t address);
     SharedAddressSpaces::Candidate _candidate() const {
@@ -132,11 +132,13 @@ private:
     int32_t _pid;
     uint64_t _startTime = 0;
     procfs::Descriptor _directory;
-    int32_t _threadId;           ///< a thread that lives
-    procfs::Descriptor _thread;  ///< its task/TID, when it is not the first one
-    procfs::ProcStat _stat;      ///< of that thread, as last seen
-    std::optional<procfs::ProcStatus> _statusAtHand;
-    StatusUse _statusServes = StatusUse::charge;  ///< the question that it is kept for
+    int32_t _threadId;              ///< a thread that lives
+    procfs::Descriptor _thread;     ///< its task/TID, when it is not the first one
+    procfs::ProcStat _stat;         ///< of that thread, as last seen
+    uint64_t _program = 0;          ///< stands for its auxv, which each exec makes anew; 0 for none
+    std::optional<uint64_t> _exec;  ///< see randomBytesIdentifier
+    std::optional<procfs::ProcStatus> _status;
+    uint64_t _statusTime = 0;                 ///< nanoseconds of CLOCK_MONOTONIC
     std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live
     ForkFamily _noFamily{0};                  ///< of a process that shares nothing by fork
     std::vector<std::string> _warnings;

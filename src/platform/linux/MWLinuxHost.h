@@ -109,7 +109,7 @@ private:
     /// A record of a process; false with errno on failure, ESRCH when the process is gone.
     bool _readProcessFile(int32_t pid, const char* name, std::string& text);
     std::optional<procfs::ProcStat> _statOfPid(int32_t pid);
-    std::optional<procfs::ProcStatus> _memoryStatusOfPid(int32_t pid, LinuxTask::StatusUse use);
+    std::optional<procfs::ProcStatus> _memoryStatusOfPid(int32_t pid);
 
     /// A copy that the caller gives back.
     template <class Record>

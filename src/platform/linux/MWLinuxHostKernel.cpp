@@ -20,8 +20,10 @@ std::span<const Record> MWLinuxHost::_handOver(const std::vector<Record>& record
 }
 
 kern_return_t MWLinuxHost::mach_memory_info(MWKernelMemoryArrays& arrays) {
-    auto memory = readKernelMemory(
-        {.procDirectory = _run.proc.get(), .sysDirectory = _sys.get(), .pageSize = _run.pageSize});
+    auto memory = readKernelMemory({.procDirectory = _run.proc.get(),
+                                    .sysDirectory = _sys.get(),
+                                    .pageSize = _run.pageSize,
+                                    .pageTables = _run.pageTables});
     if (!memory) {
         return KERN_FAILURE;
     }

@@ -94,9 +94,9 @@ bool MWLinuxHost::_readProcessFile(int32_t pid, const char* name, std::string& t
 }
 
 // Of a thread that lives: the first one can end before the others.
-std::optional<procfs::ProcStatus> MWLinuxHost::_memoryStatusOfPid(int32_t pid, LinuxTask::StatusUse use) {
+std::optional<procfs::ProcStatus> MWLinuxHost::_memoryStatusOfPid(int32_t pid) {
     if (LinuxTask* task = _taskOfPid(pid)) {
-        return task->status(use);
+        return task->status();
     }
     std::string text;
     return _readProcessFile(pid, "status", text) ? std::optional(procfs::parseStatus(text)) : std::nullopt;
@@ -163,7 +163,7 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
 }
 
 int MWLinuxHost::proc_pid_rusage(int32_t pid, rusage_info_v5& record) {
-    const auto status = _memoryStatusOfPid(pid, LinuxTask::StatusUse::charge);
+    const auto status = _memoryStatusOfPid(pid);
     if (!status || !status->hasMemory) {
         return noSuchProcess();
     }
@@ -222,7 +222,7 @@ int MWLinuxHost::ledgerTemplate(std::span<ledger_template_info> records, size_t&
 // Page tables belong to an address space: of processes that share one, only its owner is charged for them.
 int MWLinuxHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) {
     filled = 0;
-    const auto status = _memoryStatusOfPid(pid, LinuxTask::StatusUse::pageTables);
+    const auto status = _memoryStatusOfPid(pid);
     if (!status) {
         return noSuchProcess();
     }

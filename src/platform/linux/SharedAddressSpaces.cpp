@@ -43,6 +43,9 @@ std::optional<size_t> SharedAddressSpaces::_place(Members& members, int32_t thre
 ProcessIdentity SharedAddressSpaces::ownerOf(const Candidate& candidate) {
     const std::lock_guard lock(_mutex);
     Members& members = _members[candidate.startStack];
+    if (members.size() == 1 && members.front().process == candidate.process) {
+        return candidate.process;
+    }
     const auto place = _place(members, candidate.thread);
     if (!place) {
         return candidate.process;

@@ -182,7 +182,7 @@ void SmapsParser::_parseField(std::string_view line) {
 // The text of a large process is tens of megabytes, so it is parsed as it comes. The kernel hands out a page
 // of text at a time and lets go of the process's memory map in between.
 bool readMappings(int processDirectory, const char* file, std::vector<Vma>& vmas) {
-    constexpr size_t kBufferSize = 64U << 10U;
+    constexpr size_t kBufferSize = 256U << 10U;
     thread_local std::array<char, kBufferSize> buffer;
     const Descriptor text = open(processDirectory, file);
     if (!text) {
