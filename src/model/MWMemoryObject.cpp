@@ -37,21 +37,37 @@ void MWMemoryObject::addRegion(const std::shared_ptr<MWMemoryRegion>& region, ui
 void MWMemoryObject::_addRegion(const std::shared_ptr<MWMemoryRegion>& region, uint64_t pageSize,
                                 const MWRegionHolder* forProcess) {
     MW_INVARIANT(!_accurateSizes, "A finalized memory object takes no more regions.");
-    _memoryRegions->push_back(region);
+    _memoryRegions.push_back(region);
     if (region->object_id() == 0) {
         return;
     }
     if (forProcess != nullptr && (_processMemoryRegions || region->eligibleForProcessView())) {
-        if (!_processMemoryRegions) {
-            _processMemoryRegions.emplace();
+        if (_processMemoryRegions == nullptr) {
+            _processMemoryRegions = std::make_unique<MWProcessMemoryRegions>();
         }
         (*_processMemoryRegions)[forProcess->pid()].push_back(region);
     }
+    _count(*region, pageSize);
+}
+
+void MWMemoryObject::_count(MWMemoryRegion& region, uint64_t pageSize) {
+    if (_rangeList == nullptr && _onlyCounted == nullptr && region.subrangeList() == nullptr) {
+        _onlyCounted = &region;
+        _onlyCountedPageSize = pageSize;
+        return;
+    }
+    _makeRangeList();
+    _rangeList->addRegion(region, pageSize);
+    region.freeSubrangeList();
+}
+
+void MWMemoryObject::_makeRangeList() {
     if (_rangeList == nullptr) {
         _rangeList = std::make_unique<MWRangeList>();
+        if (_onlyCounted != nullptr) {
+            _rangeList->addRegion(*_onlyCounted, _onlyCountedPageSize);
+        }
     }
-    _rangeList->addRegion(*region, pageSize);
-    region->freeSubrangeList();
 }
 
 void MWMemoryObject::finalize() {
@@ -60,9 +76,10 @@ void MWMemoryObject::finalize() {
 
 void MWMemoryObject::finalizeUsingRegionDirtySize(bool regionDirty) {
     MW_INVARIANT(!_accurateSizes, "A memory object is finalized only once.");
-    const MWCategoryTotals merged = _rangeList == nullptr ? MWCategoryTotals{} : _rangeList->sum();
+    _makeRangeList();
+    const MWCategoryTotals merged = _rangeList->sum();
     if (regionDirty) {
-        const RegionSums sums = plainSums(*_memoryRegions);
+        const RegionSums sums = plainSums(_memoryRegions);
         _totalDirtySize += sums.dirty;
         _totalSwappedSize += sums.swapped;
     } else {
@@ -74,6 +91,7 @@ void MWMemoryObject::finalizeUsingRegionDirtySize(bool regionDirty) {
     _totalReclaimableSize = merged.reclaimable;
     _totalWiredSize = merged.wired;
     _rangeList.reset();
+    _onlyCounted = nullptr;
     if (_processMemoryRegions && (_processMemoryRegions->size() < 2 || _everyProcessSeesWholeObject())) {
         _processMemoryRegions.reset();
     }
@@ -116,7 +134,7 @@ void MWMemoryObject::_nameFakeRegions() {
     if (canonical.isFake()) {
         return;
     }
-    for (const auto& region : *_memoryRegions) {
+    for (const auto& region : _memoryRegions) {
         if (region->isFake()) {
             region->setName(canonical.name());
             region->setDetailedName(canonical.detailedName());
@@ -165,7 +183,7 @@ std::shared_ptr<const MWMemoryObject> MWMemoryObject::_viewOfRegions(const MWMem
                                                                      const MWRegionHolder& process) const {
     auto view = std::make_shared<MWMemoryObject>();
     view->setOwnerPid(_ownerPid);
-    view->_memoryRegions->reserve(regions.size());
+    view->_memoryRegions.reserve(regions.size());
     for (const auto& region : regions) {
         view->addRegion(region, process.pageSize());
     }
@@ -174,17 +192,17 @@ std::shared_ptr<const MWMemoryObject> MWMemoryObject::_viewOfRegions(const MWMem
 }
 
 bool MWMemoryObject::containsFakeRegion() const {
-    return std::ranges::any_of(*_memoryRegions, [](const auto& region) { return region->isFake(); });
+    return std::ranges::any_of(_memoryRegions, [](const auto& region) { return region->isFake(); });
 }
 
 const MWMemoryRegion& MWMemoryObject::_canonicalRegion() const {
-    const MWMemoryRegion& first = *_memoryRegions->front();
+    const MWMemoryRegion& first = *_memoryRegions.front();
     if (!first.inSharedCache() && _ownerPid == -1) {
         return first;
     }
     const auto namesTheObject = [&first](const auto& region) {
         return first.inSharedCache() ? !region->unusedSharedCacheRegion() : !region->isFake();
     };
-    const auto found = std::ranges::find_if(*_memoryRegions, namesTheObject);
-    return found == _memoryRegions->end() ? first : **found;
+    const auto found = std::ranges::find_if(_memoryRegions, namesTheObject);
+    return found == _memoryRegions.end() ? first : **found;
 }

@@ -32,12 +32,11 @@ public:
     int32_t ownerPid() const { return _ownerPid; }
     void setOwnerPid(int32_t ownerPid) { _ownerPid = ownerPid; }
     /// Every region added, in the order added.
-    const MWMemoryRegionList& memoryRegions() const { return *_memoryRegions; }
+    const MWMemoryRegionList& memoryRegions() const { return _memoryRegions; }
     /// The regions of each process that can have a view of its own; absent where no view differs.
-    const std::optional<MWProcessMemoryRegions>& processMemoryRegions() const {
-        return _processMemoryRegions;
-    }
-    /// Merged page ranges of the counted regions; none once finalized.
+    const MWProcessMemoryRegions* processMemoryRegions() const { return _processMemoryRegions.get(); }
+    /// Merged page ranges of the counted regions; none for one region without sub-ranges, and none once
+    /// finalized.
     const MWRangeList* rangeList() const { return _rangeList.get(); }
 
     /// `forProcess` must be present.
@@ -57,13 +56,15 @@ public:
     /// The region whose names stand for the object. The object has at least one region.
     const MWMemoryRegion& _canonicalRegion() const;
     const std::string& name() const { return _canonicalRegion().name(); }
-    const std::optional<std::string>& detailedName() const { return _canonicalRegion().detailedName(); }
+    std::optional<std::string> detailedName() const { return _canonicalRegion().detailedName(); }
     std::string fullName() const { return _canonicalRegion().fullName(); }
-    bool verbose() const { return _memoryRegions->front()->verbose(); }
+    bool verbose() const { return _memoryRegions.front()->verbose(); }
 
 private:
     void _addRegion(const std::shared_ptr<MWMemoryRegion>& region, uint64_t pageSize,
                     const MWRegionHolder* forProcess);
+    void _count(MWMemoryRegion& region, uint64_t pageSize);
+    void _makeRangeList();
     void _raiseToLargestProcess();
     bool _everyProcessSeesWholeObject() const;
     void _nameFakeRegions();
@@ -77,7 +78,10 @@ private:
     bool _accurateSizes = false;
     int32_t _ownerPid = -1;
     uint64_t _totalWiredSize = 0;
-    std::shared_ptr<MWMemoryRegionList> _memoryRegions = std::make_shared<MWMemoryRegionList>();
-    std::optional<MWProcessMemoryRegions> _processMemoryRegions;
+    MWMemoryRegionList _memoryRegions;
+    std::unique_ptr<MWProcessMemoryRegions> _processMemoryRegions;
     std::unique_ptr<MWRangeList> _rangeList;
+    /// The only counted region so far, where it needs no list of ranges: most objects have no other.
+    const MWMemoryRegion* _onlyCounted = nullptr;
+    uint64_t _onlyCountedPageSize = 0;
 };

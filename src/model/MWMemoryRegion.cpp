@@ -47,6 +47,11 @@ std::optional<std::string> nameForSmallTag(uint32_t tag) {
 
 }  // namespace
 
+const MWSharedText& MWMemoryRegion::_noText() {
+    static const auto none = std::make_shared<const std::string>();
+    return none;
+}
+
 uint64_t MWMemoryRegion::end() const {
     // Saturating, which also keeps the end of a region without an address at MWNoAddress.
     return _size > UINT64_MAX - _start ? UINT64_MAX : _start + _size;
@@ -71,7 +76,8 @@ void MWMemoryRegion::addSubrange(MWSubrange subrange, const MWCategoryTotals& me
 }
 
 std::string MWMemoryRegion::fullName() const {
-    return _detailedName && !_detailedName->empty() ? _name + ' ' + *_detailedName : _name;
+    const bool hasDetail = _detailedName != nullptr && !_detailedName->empty();
+    return hasDetail ? *_name + ' ' + *_detailedName : *_name;
 }
 
 bool MWMemoryRegion::eligibleForProcessView() const {

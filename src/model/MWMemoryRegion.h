@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "model/MWRangeList.h"
+#include "model/MWSharedText.h"
 #include "platform/MWHostRecords.h"
 
 class MWMemoryObject;
@@ -53,11 +54,20 @@ public:
     MWMemoryObject* memoryObject() const { return _memoryObject; }
     void setMemoryObject(MWMemoryObject* memoryObject) { _memoryObject = memoryObject; }
     /// Category or segment name.
-    const std::string& name() const { return _name; }
-    void setName(std::string name) { _name = std::move(name); }
+    const std::string& name() const { return *_name; }
+    /// Not null; most regions share their names with others.
+    void setName(MWSharedText name) { _name = std::move(name); }
+    void setName(std::string name) { _name = std::make_shared<const std::string>(std::move(name)); }
     /// File path, image path or other detail.
-    const std::optional<std::string>& detailedName() const { return _detailedName; }
-    void setDetailedName(std::optional<std::string> detailedName) { _detailedName = std::move(detailedName); }
+    std::optional<std::string> detailedName() const {
+        return _detailedName == nullptr ? std::nullopt : std::optional(*_detailedName);
+    }
+    /// Null for none.
+    void setDetailedName(MWSharedText detailedName) { _detailedName = std::move(detailedName); }
+    void setDetailedName(std::optional<std::string> detailedName) {
+        _detailedName =
+            detailedName ? std::make_shared<const std::string>(*std::move(detailedName)) : nullptr;
+    }
     /// Of the region's start within its backing object.
     uint64_t offset() const { return _offset; }
     void setOffset(uint64_t offset) { _offset = offset; }
@@ -108,6 +118,8 @@ public:
     static std::optional<std::string> vmLedgerNameForTag(uint64_t ledgerTag);
 
 private:
+    static const MWSharedText& _noText();
+
     bool _wired = false;
     bool _inSharedCache = false;
     bool _unusedSharedCacheRegion = false;
@@ -117,8 +129,8 @@ private:
     uint8_t _share_mode = 0;
     uint32_t _user_tag = 0;
     MWMemoryObject* _memoryObject = nullptr;
-    std::string _name;
-    std::optional<std::string> _detailedName;
+    MWSharedText _name = _noText();
+    MWSharedText _detailedName;
     uint64_t _offset = 0;
     uint64_t _start = 0;
     uint64_t _size = 0;

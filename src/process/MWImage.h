@@ -19,11 +19,11 @@ public:
     uint64_t size() const { return _size; }
     void setSize(uint64_t size) { _size = size; }
     uint64_t end() const { return _start + _size; }
-    const std::string& name() const { return *_name; }
+    const MWSharedText& name() const { return _name; }
     /// Also sets the kind; a name that does not begin with two underscores leaves the kind as it is. The text
     /// (never null) is shared with its other holders.
     void setName(MWSharedText name);
-    const std::string& ownerPath() const { return *_ownerPath; }
+    const MWSharedText& ownerPath() const { return _ownerPath; }
     void setOwnerPath(MWSharedText ownerPath) { _ownerPath = std::move(ownerPath); }
 
 private:

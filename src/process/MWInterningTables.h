@@ -8,8 +8,7 @@
 #include <string_view>
 #include <vector>
 
-/// An immutable text with several holders.
-using MWSharedText = std::shared_ptr<const std::string>;
+#include "model/MWSharedText.h"
 
 /// Keeps one copy of each distinct text, for any number of threads and without a lock: a slot goes from empty
 /// to a text once, by compare-and-swap, and never changes again. A search looks at a bounded number of slots,

@@ -65,8 +65,8 @@ HeapsnapRegion MWRecordedProcess::_regionOf(MWImageEnumerator& images, const MWW
     const auto bytes = [this](uint64_t pages) { return MWSaturatingMultiply(pages, pageSize()); };
     const vm_region_submap_info_64& info = walked.info;
     const MWImage* image = images.nextImageForStart(walked.address, {.end = walked.address + walked.size});
-    std::string type = image != nullptr ? image->name() : MWMemoryRegion::categoryNameForTag(info.user_tag);
-    std::string path = image != nullptr ? image->ownerPath() : walked.path.value_or("");
+    std::string type = image != nullptr ? *image->name() : MWMemoryRegion::categoryNameForTag(info.user_tag);
+    std::string path = image != nullptr ? *image->ownerPath() : walked.path.value_or("");
     HeapsnapRegion region;
     region.start = walked.address;
     region.length = walked.size;

@@ -1,5 +1,7 @@
 #include <fmt/core.h>
 
+#include <algorithm>
+
 #include "platform/MWRegionTags.h"
 #include "platform/MWSizeMath.h"
 #include "process/MWUserProcess.h"
@@ -45,6 +47,11 @@ OwnedCharge chargeOf(const OwnedObjectRecord& object) {
         return {.dirty = object.wired, .swapped = 0};
     }
     return {.dirty = MWSaturatingSubtract(object.resident, object.reusable), .swapped = object.compressed};
+}
+
+const MWSharedText& mappedFileName() {
+    static const auto name = std::make_shared<const std::string>("mapped file");
+    return name;
 }
 
 /// The category name, with the ledger that the object is charged to.
@@ -113,6 +120,24 @@ struct MWUserProcess::MemoryGathering {
     MWMemoryRegionList regions = {};
     std::shared_ptr<MWMemoryRegion> holder = {};
     uint64_t ownedCharge = 0;
+    // Texts that further regions have as well.
+    std::vector<std::pair<uint32_t, MWSharedText>> categoryNames = {};
+    MWSharedText lastPath = {};
+
+    const MWSharedText& categoryName(uint32_t tag) {
+        const auto known = std::ranges::find(categoryNames, tag, &std::pair<uint32_t, MWSharedText>::first);
+        if (known != categoryNames.end()) {
+            return known->second;
+        }
+        const auto name = std::make_shared<const std::string>(MWMemoryRegion::categoryNameForTag(tag));
+        return categoryNames.emplace_back(tag, name).second;
+    }
+    const MWSharedText& pathText(const std::string& path) {
+        if (lastPath == nullptr || *lastPath != path) {
+            lastPath = std::make_shared<const std::string>(path);
+        }
+        return lastPath;
+    }
 };
 
 void MWUserProcess::_gatherMemoryData() {
@@ -207,13 +232,13 @@ void MWUserProcess::_nameRegion(MemoryGathering& gathering, MWMemoryRegion& regi
     } else if (walked.name) {
         region.setName(*walked.name);
     } else if (walked.path || walked.info.external_pager != 0) {
-        region.setName("mapped file");
-        region.setDetailedName(walked.path);
+        region.setName(mappedFileName());
+        region.setDetailedName(walked.path ? gathering.pathText(*walked.path) : nullptr);
     } else if (reservedName != nullptr) {
         region.setName(reservedName);
         region.setVerbose(true);
     } else {
-        region.setName(MWMemoryRegion::categoryNameForTag(walked.info.user_tag));
+        region.setName(gathering.categoryName(walked.info.user_tag));
         if (gathering.breakDown) {
             _matchOwnedObject(gathering, region, walked);
         }

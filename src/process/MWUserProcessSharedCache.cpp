@@ -6,6 +6,11 @@
 
 namespace {
 
+const MWSharedText& linkeditDetail() {
+    static const auto text = std::make_shared<const std::string>("rtld shared cache");
+    return text;
+}
+
 constexpr const char* kGapName = "unused rtld shared cache area";
 
 bool isMeasured(uint8_t kind) {
@@ -118,7 +123,7 @@ bool MWUserProcess::_addSharedCacheImagePiece(SharedMappingSplit& split) {
     }
     const auto piece = split.regionTo(split.cursor, end);
     piece->setName(image.name());
-    piece->setDetailedName(image.segment() == SegmentLinkedit ? "rtld shared cache" : image.ownerPath());
+    piece->setDetailedName(image.segment() == SegmentLinkedit ? linkeditDetail() : image.ownerPath());
     piece->setSegment(image.segment());
     if (isMeasured(image.segment()) &&
         !_populateMemoryRegionWithPageQueries(piece, split.mapping.withRegionInfo)) {

@@ -16,7 +16,8 @@ constexpr uint64_t kPage = 4096;
 class AddressSpaceTest : public testing::Test {
 protected:
     AddressSpace build(const std::string& smaps, int32_t pid = 10, uint64_t ipcNamespace = 1) {
-        return {backedVmas(procfs::parseSmaps(smaps), _devices, -1),
+        std::vector<procfs::Vma> vmas = procfs::parseSmaps(smaps);
+        return {backedVmas(vmas, _devices, -1),
                 {.pid = pid,
                  .startTime = 5,
                  .ipcNamespace = ipcNamespace,

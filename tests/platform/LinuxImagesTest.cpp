@@ -15,19 +15,11 @@ namespace {
 
 constexpr uint64_t kPage = 4096;
 
-std::vector<BackedVma> backed(const std::string& smaps) {
-    ShmemDevices devices;
-    std::vector<BackedVma> result;
-    for (procfs::Vma& vma : procfs::parseSmaps(smaps)) {
-        const Backing backing = backingOf(vma, devices, -1);
-        result.push_back({std::move(vma), backing});
-    }
-    return result;
-}
-
 /// "PATH", then "  START+SIZE NAME" for each of its segments.
 std::string listing(const std::string& smaps) {
-    const std::vector<BackedVma> vmas = backed(smaps);
+    ShmemDevices devices;
+    std::vector<procfs::Vma> texts = procfs::parseSmaps(smaps);
+    const std::vector<BackedVma> vmas = backedVmas(texts, devices, -1);
     const LinuxImages found = imagesOfVmas(vmas);
     EXPECT_EQ(found.imageOfVma.size(), vmas.size());
     std::ostringstream text;
@@ -109,17 +101,17 @@ TEST(LinuxImages, MemorySharedByForkIsAnObjectForEachImage) {
     for (uint64_t address = 0x400000; address < 0x409000; address += kPage) {
         pages.pages[address] = {uint64_t{1} << 63U};
     }
-    const AddressSpace space(
-        backedVmas(procfs::parseSmaps("400000-401000 r-xp 00000000 fe:00 1 /lib/x\nRss: 0 kB\n"
-                                      "401000-402000 rw-p 00001000 fe:00 1 /lib/x\n" +
-                                      counts + "402000-403000 rw-p 00000000 00:00 0\n" + counts +
-                                      "404000-405000 r-xp 00000000 fe:00 2 /lib/y\nRss: 0 kB\n"
-                                      "405000-406000 rw-p 00001000 fe:00 2 /lib/y\n" +
-                                      counts + "406000-407000 rw-p 00000000 00:00 0\n" + counts +
-                                      "408000-409000 rw-p 00000000 00:00 0\n" + counts),
-                   devices, -1),
-        {.pid = 10, .startTime = 5, .family = [&]() -> ForkFamily& { return family; }}, pages,
-        {identity, devices, names, kPage});
+    std::vector<procfs::Vma> vmas = procfs::parseSmaps(
+        "400000-401000 r-xp 00000000 fe:00 1 /lib/x\nRss: 0 kB\n"
+        "401000-402000 rw-p 00001000 fe:00 1 /lib/x\n" +
+        counts + "402000-403000 rw-p 00000000 00:00 0\n" + counts +
+        "404000-405000 r-xp 00000000 fe:00 2 /lib/y\nRss: 0 kB\n"
+        "405000-406000 rw-p 00001000 fe:00 2 /lib/y\n" +
+        counts + "406000-407000 rw-p 00000000 00:00 0\n" + counts + "408000-409000 rw-p 00000000 00:00 0\n" +
+        counts);
+    const AddressSpace space(backedVmas(vmas, devices, -1),
+                             {.pid = 10, .startTime = 5, .family = [&]() -> ForkFamily& { return family; }},
+                             pages, {identity, devices, names, kPage});
     const auto objectAt = [&](uint64_t address) {
         const AddressSpaceRegion* region = space.regionAtOrAbove(address);
         EXPECT_EQ(region->info.share_mode, SM_COW);

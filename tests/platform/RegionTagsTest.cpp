@@ -17,11 +17,8 @@ namespace {
 
 std::vector<uint32_t> tagsOf(const std::string& smaps, RegionNames& names) {
     ShmemDevices devices;
-    std::vector<BackedVma> backed;
-    for (procfs::Vma& vma : procfs::parseSmaps(smaps)) {
-        const Backing backing = backingOf(vma, devices, -1);
-        backed.push_back({std::move(vma), backing});
-    }
+    std::vector<procfs::Vma> vmas = procfs::parseSmaps(smaps);
+    const std::vector<BackedVma> backed = backedVmas(vmas, devices, -1);
     return tagsForVmas(backed, imagesOfVmas(backed), names);
 }
 

@@ -137,8 +137,8 @@ TEST(MWUserProcessSharedCacheTest, ListsImagesBySegment) {
     const MWImageList listed = InspectedProcess::of(7)->listImages();
     Lines lines;
     for (const MWImage& image : listed) {
-        lines.push_back(fmt::format("{:x}+{:x} {} {} {}", image.start(), image.size(), image.name(),
-                                    image.segment(), image.ownerPath()));
+        lines.push_back(fmt::format("{:x}+{:x} {} {} {}", image.start(), image.size(), *image.name(),
+                                    image.segment(), *image.ownerPath()));
     }
     EXPECT_EQ(lines, (Lines{"1000+40 __OBJC_RO 2 /bin/tool", "2000+50 __LINKEDIT 4 /lib/cached",
                             "3000+30 unknown 0 /bin/tool", "4000+10 __OBJC_RW 3 /bin/tool",

@@ -130,7 +130,7 @@ public:
         : _owner(owner), _pages(pages), _context(context), _regions(regions) {}
 
     /// `image` is the one whose segment the mapping is, or null.
-    void add(BackedVma backed, uint32_t tag, const LinuxImage* image) {
+    void add(const BackedVma& backed, uint32_t tag, const LinuxImage* image) {
         const bool isFileMapping = backed.backing != Backing::anonymous;
         if (backed.backing != Backing::special && needsOwnershipRuns(backed.vma, isFileMapping)) {
             const std::vector<OwnershipRun> runs = ownershipRuns(
@@ -142,7 +142,7 @@ public:
                 return;
             }
         }
-        _addWhole(std::move(backed), tag);
+        _addWhole(backed, tag);
     }
 
     uint64_t partOfFamilyMemory() const { return _partOfFamilyMemory; }
@@ -178,7 +178,7 @@ private:
         region.info.offset = place.offset;
     }
 
-    void _addWhole(BackedVma backed, uint32_t tag) {
+    void _addWhole(const BackedVma& backed, uint32_t tag) {
         Vma& vma = backed.vma;
         AddressSpaceRegion region = {.start = vma.start,
                                      .size = vma.size(),
@@ -339,25 +339,25 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
                                                                                    : Backing::file;
 }
 
-std::vector<BackedVma> backedVmas(std::vector<Vma> vmas, ShmemDevices& shmemDevices, int processDirectory) {
+std::vector<BackedVma> backedVmas(std::vector<Vma>& vmas, ShmemDevices& shmemDevices, int processDirectory) {
     std::vector<BackedVma> backed;
     backed.reserve(vmas.size());
     for (Vma& vma : vmas) {
         const Backing backing = backingOf(vma, shmemDevices, processDirectory);
-        backed.push_back({std::move(vma), backing});
+        backed.push_back({vma, backing});
     }
     return backed;
 }
 
-AddressSpace::AddressSpace(std::vector<BackedVma> backed, const AddressSpaceOwner& owner, PageSource& pages,
-                           const AddressSpaceContext& context) {
+AddressSpace::AddressSpace(const std::vector<BackedVma>& backed, const AddressSpaceOwner& owner,
+                           PageSource& pages, const AddressSpaceContext& context) {
     LinuxImages images = imagesOfVmas(backed);
     const std::vector<uint32_t> tags = tagsForVmas(backed, images, context.names);
     _regions.reserve(backed.size());
     RegionBuilder builder(owner, pages, context, _regions);
     for (size_t index = 0; index < backed.size(); ++index) {
         const size_t image = images.imageOfVma[index];
-        builder.add(std::move(backed[index]), tags[index],
+        builder.add(backed[index], tags[index],
                     image == LinuxImages::kNoImage ? nullptr : &images.images[image]);
     }
     _images = std::move(images.images);

@@ -56,7 +56,8 @@ struct AddressSpaceRegion {
 /// the mappings with their counts, and their pages; immutable afterwards.
 class AddressSpace {
 public:
-    AddressSpace(std::vector<BackedVma> vmas, const AddressSpaceOwner& owner, PageSource& pages,
+    /// Takes the mappings' paths.
+    AddressSpace(const std::vector<BackedVma>& vmas, const AddressSpaceOwner& owner, PageSource& pages,
                  const AddressSpaceContext& context);
 
     const std::vector<AddressSpaceRegion>& regions() const { return _regions; }
@@ -77,8 +78,8 @@ private:
 /// Whether it maps a SysV segment, which only its path tells, never inode 0: its inode is the segment's id.
 bool isSysVSegment(const procfs::Vma& vma);
 
-/// The mappings with what backs them; see backingOf.
-std::vector<BackedVma> backedVmas(std::vector<procfs::Vma> vmas, ShmemDevices& shmemDevices,
+/// The mappings, to which the answer refers, with what backs them; see backingOf.
+std::vector<BackedVma> backedVmas(std::vector<procfs::Vma>& vmas, ShmemDevices& shmemDevices,
                                   int processDirectory);
 
 /// Everything that a mapping's path, flags and device tell of its backing.

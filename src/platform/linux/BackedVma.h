@@ -13,8 +13,8 @@ enum class Backing : uint8_t {
     special,  ///< the kernel's own mappings and devices
 };
 
-/// A mapping with its backing. The mappings of one process are ascending.
+/// A mapping, which somebody else holds, with its backing. The mappings of one process are ascending.
 struct BackedVma {
-    procfs::Vma vma;
+    procfs::Vma& vma;
     Backing backing = Backing::anonymous;
 };

@@ -176,14 +176,13 @@ bool LinuxTask::_countsPayOff(const procfs::ProcStatus& status) const {
 bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
     const int directory = memoryDirectory();
     _pages.emplace(directory, PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
-    mappings = {};
-    std::vector<procfs::Vma> vmas;
+    mappings.counts.reset();
     const auto current = status();
     if (current && _countsPayOff(*current)) {
-        if (!procfs::readMappings(directory, "maps", vmas)) {
+        if (!procfs::readMappings(directory, "maps", mappings.texts)) {
             return false;
         }
-        mappings.vmas = backedVmas(std::move(vmas), _run.shmemDevices, directory);
+        mappings.vmas = backedVmas(mappings.texts, _run.shmemDevices, directory);
         const PageScanner scan = [this](const PageScan& pages, std::span<ScannedRange> ranges,
                                         uint64_t& end) { return _pages->scan(pages, ranges, end); };
         mappings.counts = countWithoutSmaps(mappings.vmas,
@@ -198,10 +197,10 @@ bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
             return true;
         }
     }
-    if (!procfs::readMappings(directory, "smaps", vmas)) {
+    if (!procfs::readMappings(directory, "smaps", mappings.texts)) {
         return false;
     }
-    mappings.vmas = backedVmas(std::move(vmas), _run.shmemDevices, directory);
+    mappings.vmas = backedVmas(mappings.texts, _run.shmemDevices, directory);
     return true;
 }
 
@@ -232,7 +231,8 @@ kern_return_t LinuxTask::takeSnapshot() {
     if (_space) {
         return KERN_SUCCESS;
     }
-    Mappings mappings;
+    // Thousands of processes are looked at in turn: room for the mappings is made once for a thread.
+    thread_local Mappings mappings;
     const kern_return_t code = _readMappings(mappings);
     if (code != KERN_SUCCESS) {
         return code;
@@ -245,7 +245,7 @@ kern_return_t LinuxTask::takeSnapshot() {
     const bool isAlone = scanned.has_value();
     const ProcessIdentity owner = _run.sharedSpaces.ownerOf(_candidate());
     _space.emplace(
-        std::move(mappings.vmas),
+        mappings.vmas,
         AddressSpaceOwner{.pid = owner.pid,
                           .startTime = owner.startTime,
                           .ipcNamespace = hasSysVSegments(mappings.vmas)

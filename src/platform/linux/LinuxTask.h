@@ -113,7 +113,8 @@ private:
     void _surveyOwnedObjects();
 
     struct Mappings {
-        std::vector<BackedVma> vmas;
+        std::vector<procfs::Vma> texts;
+        std::vector<BackedVma> vmas;          ///< of `texts`
         std::optional<MappingCounts> counts;  ///< where smaps was not read
     };
     kern_return_t _readMappings(Mappings& mappings);

@@ -150,11 +150,11 @@ void SmapsParser::_parseLine(std::string_view line) {
 
 // Sizes of a mapping that could not be read must not land on the one before it.
 void SmapsParser::_parseHeader(std::string_view line) {
-    Vma vma;
     const uint64_t lowest = _vmas.empty() ? 0 : _vmas.back().end;
+    Vma& vma = _vmas.emplace_back();
     _inMapping = parseMapping(line, vma) && vma.start >= lowest;
-    if (_inMapping) {
-        _vmas.push_back(std::move(vma));
+    if (!_inMapping) {
+        _vmas.pop_back();
     }
 }
 
@@ -188,7 +188,7 @@ bool readMappings(int processDirectory, const char* file, std::vector<Vma>& vmas
     if (!text) {
         return false;
     }
-    SmapsParser parser;
+    SmapsParser parser(std::move(vmas));
     ptrdiff_t count = 0;
     while ((count = readSome(text.get(), buffer)) > 0) {
         parser.feed({buffer.data(), static_cast<size_t>(count)});

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 namespace procfs {
@@ -66,6 +67,9 @@ struct Vma {
 /// list of mappings whose end is above their start, in ascending order and without overlap.
 class SmapsParser {
 public:
+    /// Uses the room of `vmas`, whatever they were.
+    explicit SmapsParser(std::vector<Vma> vmas = {}) : _vmas(std::move(vmas)) { _vmas.clear(); }
+
     void feed(std::string_view text);
     /// The mappings of all the text fed; the parser is then empty again.
     std::vector<Vma> finish();
