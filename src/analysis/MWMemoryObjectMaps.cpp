@@ -1,5 +1,7 @@
 #include "analysis/MWMemoryObjectMaps.h"
 
+#include <algorithm>
+
 namespace {
 
 constexpr size_t kObjectsPerProcess = 100;
@@ -21,8 +23,8 @@ uint64_t keyForRegion(const MWMemoryRegion& region, const MWProcess& process) {
 
 }  // namespace
 
-MWMemoryObjectMaps::MWMemoryObjectMaps(size_t processCount)
-    : _memoryObjects(kObjectsPerProcess * processCount),
+MWMemoryObjectMaps::MWMemoryObjectMaps(size_t processCount, size_t regionCount)
+    : _memoryObjects(std::min(kObjectsPerProcess * processCount, regionCount)),
       _sharedCacheTranslatedMemoryObjects(kTranslatedSharedCacheObjects),
       _textMemoryObjects(kImageObjectsPerProcess * processCount),
       _linkeditMemoryObjects(kImageObjectsPerProcess * processCount) {}
@@ -34,7 +36,7 @@ MWMemoryObject& MWMemoryObjectMaps::objectForRegion(const MWMemoryRegion& region
     }
     std::shared_ptr<MWMemoryObject>& object = _mapForRegion(region, process)[key];
     if (!object) {
-        object = std::make_shared<MWMemoryObject>();
+        object = _makeObject();
     }
     return *object;
 }
@@ -54,13 +56,13 @@ MWMemoryObjectMap& MWMemoryObjectMaps::_mapForRegion(const MWMemoryRegion& regio
 }
 
 MWMemoryObject& MWMemoryObjectMaps::_addUniqueObject() {
-    return *_uniqueMemoryObjects.emplace_back(std::make_shared<MWMemoryObject>());
+    return *_uniqueMemoryObjects.emplace_back(_makeObject());
 }
 
-size_t MWMemoryObjectMaps::objectCount() const {
-    return _memoryObjects.size() + _sharedCacheMemoryObjects.size() +
-           _sharedCacheTranslatedMemoryObjects.size() + _uniqueMemoryObjects.size() +
-           _textMemoryObjects.size() + _linkeditMemoryObjects.size();
+std::shared_ptr<MWMemoryObject> MWMemoryObjectMaps::_makeObject() {
+    auto object = std::make_shared<MWMemoryObject>();
+    object->setOrdinal(_objectCount++);
+    return object;
 }
 
 void MWMemoryObjectMaps::forEachObject(const std::function<void(MWMemoryObject&)>& block) const {

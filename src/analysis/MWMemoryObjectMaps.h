@@ -23,19 +23,20 @@ using MWMemoryObjectMap = tsl::robin_map<uint64_t, std::shared_ptr<MWMemoryObjec
 /// as ordinary memory therefore makes two memory objects.
 class MWMemoryObjectMaps {
 public:
-    /// The count of processes only sizes the maps.
-    explicit MWMemoryObjectMaps(size_t processCount);
+    /// The counts only size the maps.
+    MWMemoryObjectMaps(size_t processCount, size_t regionCount);
 
     /// The object that `region` of `process` belongs to, new when no region of it was met before. A region
     /// without a usable key gets an object of its own at every call.
     MWMemoryObject& objectForRegion(const MWMemoryRegion& region, const MWProcess& process);
-    size_t objectCount() const;
+    size_t objectCount() const { return _objectCount; }
     /// Every object once.
     void forEachObject(const std::function<void(MWMemoryObject&)>& block) const;
 
 private:
     MWMemoryObjectMap& _mapForRegion(const MWMemoryRegion& region, const MWProcess& process);
     MWMemoryObject& _addUniqueObject();
+    std::shared_ptr<MWMemoryObject> _makeObject();
 
     /// Ordinary regions, by kernel object identifier.
     MWMemoryObjectMap _memoryObjects;
@@ -46,4 +47,5 @@ private:
     MWMemoryObjectMap _textMemoryObjects;
     MWMemoryObjectMap _linkeditMemoryObjects;
     std::vector<std::shared_ptr<MWMemoryObject>> _uniqueMemoryObjects;
+    uint32_t _objectCount = 0;
 };

@@ -27,9 +27,18 @@ MWProcessList MWMemweight::_processesBySortingPidDesc(MWProcessList processes) {
     return processes;
 }
 
+// One that takes long must not be begun when all the others are done and the other processors have nothing
+// left to do.
+MWProcessList MWMemweight::_longestFirst(MWProcessList processes) {
+    std::ranges::stable_partition(processes,
+                                  [](const auto& process) { return process->takesLongToGather(); });
+    return processes;
+}
+
 bool MWMemweight::gatherData() {
     const MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
     const MWProcessList ordered = _processesBySortingPidDesc(_processes);
+    const MWProcessList scheduled = _longestFirst(ordered);
     _gatherStartTime = MWTime::now();
     _prepareToGather(queue, ordered);
     std::atomic<bool> stoppedEarly = false;
@@ -37,7 +46,7 @@ bool MWMemweight::gatherData() {
         if (_earlyExit) {
             stoppedEarly = true;
         } else {
-            ordered[index]->gatherData();
+            scheduled[index]->gatherData();
         }
     });
     if (stoppedEarly) {
@@ -59,10 +68,15 @@ void MWMemweight::_prepareToGather(const MWConcurrentQueue& queue, const MWProce
 
 void MWMemweight::analyzeData() {
     _pidToMemweight.clear();
-    _objectMaps.emplace(_processes.size());
+    size_t regions = 0;
+    for (const auto& process : _processes) {
+        regions += _regionsOf(*process).size();
+    }
+    _objectMaps.emplace(_processes.size(), regions);
     for (const auto& process : _processes) {
         _addProcess(*process);
     }
+    _objectCount = _objectMaps->objectCount();
     finalizeObjects();
     _buildProcessToMemweightMap();
 }

@@ -109,6 +109,7 @@ public:
     static void _totalForCategories(const MWCategoryTable& categories, MWCategoryTotals& outTotal);
 
 private:
+    static MWProcessList _longestFirst(MWProcessList processes);
     void _prepareToGather(const MWConcurrentQueue& queue, const MWProcessList& processes) const;
 
     struct Messages {
@@ -133,6 +134,7 @@ private:
     /// objects that are gone, and nobody may follow them any more.
     std::optional<MWMemoryObjectMaps> _objectMaps;
     MWProcessToProcessGroups _groupsOf;
+    size_t _objectCount = 0;  ///< of the analysis, also when the maps are gone
     std::vector<MWOutputFormatter*> _outputFormatters;
     std::atomic<bool> _earlyExit = false;
     uint32_t _qualityOfService = QOS_CLASS_UTILITY;

@@ -77,11 +77,12 @@ MWCategoryTable MWMemweight::_categoriesForObjects(const MWProcessGroup::Objects
 
 MWCategoryTable MWMemweight::_categoriesForAllProcessesShouldSummarize(bool summarize) const {
     MWCategoryTable table;
-    ObjectSet counted;
+    std::vector<bool> counted(_objectCount);
     for (const MWProcess* process : _notHiddenProcesses()) {
         for (const auto& region : _regionsOf(*process)) {
             const MWMemoryObject* object = region->memoryObject();
-            if (counted.insert(object).second) {
+            if (!counted[object->ordinal()]) {
+                counted[object->ordinal()] = true;
                 categoryForObject(table, *object, summarize).addMemoryObject(object->shared_from_this());
             }
         }

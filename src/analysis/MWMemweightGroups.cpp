@@ -1,5 +1,3 @@
-#include <tsl/robin_map.h>
-
 #include <algorithm>
 #include <memory>
 #include <set>
@@ -55,8 +53,8 @@ struct Sharers {
 /// The sharer set of each object, in the order in which the objects are first met.
 class SharerSets {
 public:
-    SharerSets(std::set<int32_t> displayedPids, size_t objects) : _displayedPids(std::move(displayedPids)) {
-        _indexes.reserve(objects);
+    SharerSets(std::set<int32_t> displayedPids, size_t objects)
+        : _displayedPids(std::move(displayedPids)), _places(objects) {
         _sharers.reserve(objects);
     }
 
@@ -65,11 +63,12 @@ public:
         if (process.hiddenFromDisplay() && !_admitsHidden(*object)) {
             return;
         }
-        const auto [entry, isNew] = _indexes.try_emplace(object, _sharers.size());
-        if (isNew) {
+        uint32_t& place = _places[object->ordinal()];
+        if (place == 0) {
             _sharers.push_back({.object = object, .first = &process});
+            place = static_cast<uint32_t>(_sharers.size());
         } else {
-            _sharers[entry->second].add(process);
+            _sharers[place - 1].add(process);
         }
     }
     const std::vector<Sharers>& all() const { return _sharers; }
@@ -90,7 +89,7 @@ private:
 
     std::set<int32_t> _displayedPids;
     std::vector<Sharers> _sharers;
-    tsl::robin_map<const MWMemoryObject*, size_t> _indexes;
+    std::vector<uint32_t> _places;  ///< by the object's ordinal, counted from 1; 0 for none
     std::unordered_map<const MWMemoryObject*, bool> _containsFakeRegion;
 };
 
@@ -150,7 +149,7 @@ MWProcessToProcessGroups MWMemweight::_generateProcessToProcessGroups() const {
     for (const MWProcess* process : _notHiddenProcesses()) {
         displayedPids.insert(process->pid());
     }
-    SharerSets sharerSets(displayedPids, _objectMaps->objectCount());
+    SharerSets sharerSets(displayedPids, _objectCount);
     for (const auto& process : _processes) {
         mw_enumerateObjectsWithBatchSize(_regionsOf(*process), kRegionsPerSlice,
                                          [&](const std::shared_ptr<MWMemoryRegion>* regions, size_t count) {

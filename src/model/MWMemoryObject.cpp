@@ -70,14 +70,20 @@ void MWMemoryObject::_makeRangeList() {
     }
 }
 
+MWCategoryTotals MWMemoryObject::_mergedTotals() const {
+    if (_rangeList != nullptr) {
+        return _rangeList->sum();
+    }
+    return _onlyCounted == nullptr ? MWCategoryTotals{} : _onlyCounted->totals();
+}
+
 void MWMemoryObject::finalize() {
     finalizeUsingRegionDirtySize(false);
 }
 
 void MWMemoryObject::finalizeUsingRegionDirtySize(bool regionDirty) {
     MW_INVARIANT(!_accurateSizes, "A memory object is finalized only once.");
-    _makeRangeList();
-    const MWCategoryTotals merged = _rangeList->sum();
+    const MWCategoryTotals merged = _mergedTotals();
     if (regionDirty) {
         const RegionSums sums = plainSums(_memoryRegions);
         _totalDirtySize += sums.dirty;

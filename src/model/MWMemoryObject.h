@@ -31,6 +31,9 @@ public:
     /// The process that owns the memory exclusively, or -1.
     int32_t ownerPid() const { return _ownerPid; }
     void setOwnerPid(int32_t ownerPid) { _ownerPid = ownerPid; }
+    /// The object's number in its analysis, in the order in which objects are met; 0 outside of one.
+    uint32_t ordinal() const { return _ordinal; }
+    void setOrdinal(uint32_t ordinal) { _ordinal = ordinal; }
     /// Every region added, in the order added.
     const MWMemoryRegionList& memoryRegions() const { return _memoryRegions; }
     /// The regions of each process that can have a view of its own; absent where no view differs.
@@ -65,6 +68,7 @@ private:
                     const MWRegionHolder* forProcess);
     void _count(MWMemoryRegion& region, uint64_t pageSize);
     void _makeRangeList();
+    MWCategoryTotals _mergedTotals() const;
     void _raiseToLargestProcess();
     bool _everyProcessSeesWholeObject() const;
     void _nameFakeRegions();
@@ -77,6 +81,7 @@ private:
     uint64_t _totalReclaimableSize = 0;
     bool _accurateSizes = false;
     int32_t _ownerPid = -1;
+    uint32_t _ordinal = 0;
     uint64_t _totalWiredSize = 0;
     MWMemoryRegionList _memoryRegions;
     std::unique_ptr<MWProcessMemoryRegions> _processMemoryRegions;

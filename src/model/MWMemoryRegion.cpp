@@ -47,9 +47,9 @@ std::optional<std::string> nameForSmallTag(uint32_t tag) {
 
 }  // namespace
 
-const MWSharedText& MWMemoryRegion::_noText() {
-    static const auto none = std::make_shared<const std::string>();
-    return none;
+MWSharedText MWMemoryRegion::_noText() {
+    static const auto& none = *new std::string;
+    return MWUncountedText(none);
 }
 
 uint64_t MWMemoryRegion::end() const {

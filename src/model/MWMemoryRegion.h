@@ -100,6 +100,14 @@ public:
     /// By start ascending, then by size descending, so that an enclosing region precedes what it contains.
     std::strong_ordering compare(const MWMemoryRegion& other) const;
     uint64_t wiredSize() const { return _wired ? _size : 0; }
+    /// The region's own sizes; `regions` is 0.
+    MWCategoryTotals totals() const {
+        return {.dirty = _dirtySize,
+                .swapped = _swappedSize,
+                .clean = _cleanNonSpecSize,
+                .reclaimable = _reclaimableSize,
+                .wired = wiredSize()};
+    }
     /// `subrange` lies in the backing object, not in the address space.
     void addSubrange(MWSubrange subrange, const MWCategoryTotals& memoryTotal, uint64_t pageSize);
     void freeSubrangeList() { _subrangeList.reset(); }
@@ -118,7 +126,7 @@ public:
     static std::optional<std::string> vmLedgerNameForTag(uint64_t ledgerTag);
 
 private:
-    static const MWSharedText& _noText();
+    static MWSharedText _noText();
 
     bool _wired = false;
     bool _inSharedCache = false;

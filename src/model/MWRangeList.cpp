@@ -119,12 +119,7 @@ void MWRangeList::addRegion(const MWMemoryRegion& region, uint64_t pageSize) {
         _addRangeList(*region.subrangeList(), pageSize);
         return;
     }
-    addRange({.start = region.offset(), .length = region.size()}, pageSize,
-             {.dirty = region.dirtySize(),
-              .swapped = region.swappedSize(),
-              .clean = region.cleanNonSpecSize(),
-              .reclaimable = region.reclaimableSize(),
-              .wired = region.wiredSize()});
+    addRange({.start = region.offset(), .length = region.size()}, pageSize, region.totals());
 }
 
 void MWRangeList::_addRangeList(const MWRangeList& other, uint64_t pageSize) {

@@ -4,9 +4,9 @@
 
 #include "model/MWMemoryRegion.h"
 
-const MWSharedText& MWImage::_noText() {
-    static const auto none = std::make_shared<const std::string>();
-    return none;
+MWSharedText MWImage::_noText() {
+    static const auto& none = *new std::string;
+    return MWUncountedText(none);
 }
 
 void MWImage::setName(MWSharedText name) {

@@ -27,7 +27,7 @@ public:
     void setOwnerPath(MWSharedText ownerPath) { _ownerPath = std::move(ownerPath); }
 
 private:
-    static const MWSharedText& _noText();
+    static MWSharedText _noText();
 
     uint8_t _segment = 0;
     uint64_t _start = 0;

@@ -24,11 +24,6 @@ const std::string& textInSlot(std::atomic<const std::string*>& slot, std::string
     return won ? *made.release() : *stored;
 }
 
-/// A holder of a text that needs none.
-MWSharedText unowned(const std::string& text) {
-    return {std::shared_ptr<const void>(), &text};
-}
-
 }  // namespace
 
 MWInterningTable::~MWInterningTable() {
@@ -40,7 +35,7 @@ MWSharedText MWInterningTable::intern(std::string_view text, size_t firstSlot) {
     for (size_t probe = 0; probe < _mostProbes; ++probe) {
         const std::string& stored = textInSlot(_slots[(firstSlot + probe) % _slots.size()], text, made);
         if (stored == text) {
-            return unowned(stored);
+            return MWUncountedText(stored);
         }
     }
     return made != nullptr ? MWSharedText(std::move(made)) : std::make_shared<const std::string>(text);

@@ -27,6 +27,7 @@ public:
     bool _isAlive() const override { return true; }
     /// Zones in zone order, then sites in record order. Asks anew each time.
     void gatherData() override;
+    bool takesLongToGather() const override { return true; }
     /// "Maps": the kernel's counters by name, which are not added up over processes.
     MWAuxDataTree auxData() const override;
 

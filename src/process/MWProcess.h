@@ -77,6 +77,8 @@ public:
     virtual bool _populateTask() { return false; }
     /// Whatever has to be known of all processes before the first of them is gathered.
     virtual void prepareToGatherData() {}
+    /// Whether gathering takes far longer than that of an ordinary process.
+    virtual bool takesLongToGather() const { return false; }
     /// Fills `memoryRegions` and the other gathered data.
     virtual void gatherData() {}
     /// None when the process has no auxiliary data.

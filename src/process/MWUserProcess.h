@@ -84,6 +84,7 @@ public:
 
     /// Has the host look at what the process owns, where it will be asked for it.
     void prepareToGatherData() override;
+    bool takesLongToGather() const override { return _physMemweight >= kLargeProcess; }
     /// Does nothing for a process that has its regions.
     void gatherData() override;
     /// Whether `other` stands for the same process: a pid alone can have been given away.
@@ -225,6 +226,7 @@ private:
     void _chargeSharedPage(SharedPageCharge& measured, int32_t word);
     void _creditPendingGap(const MWMemoryRegion& nextRegion, int32_t word);
 
+    static constexpr uint64_t kLargeProcess = uint64_t{256} << 20U;
     uint64_t _physMemweight = 0;
     std::pair<uint64_t, uint64_t> _startTime;  ///< seconds and microseconds
 };

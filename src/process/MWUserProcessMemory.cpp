@@ -49,9 +49,9 @@ OwnedCharge chargeOf(const OwnedObjectRecord& object) {
     return {.dirty = MWSaturatingSubtract(object.resident, object.reusable), .swapped = object.compressed};
 }
 
-const MWSharedText& mappedFileName() {
-    static const auto name = std::make_shared<const std::string>("mapped file");
-    return name;
+MWSharedText mappedFileName() {
+    static const auto& name = *new std::string("mapped file");
+    return MWUncountedText(name);
 }
 
 /// The category name, with the ledger that the object is charged to.

@@ -339,11 +339,24 @@ Backing backingOf(const Vma& vma, ShmemDevices& shmemDevices, int processDirecto
                                                                                    : Backing::file;
 }
 
+namespace {
+
+bool isSamePlainFile(const BackedVma& before, const Vma& vma) {
+    constexpr uint32_t kOfTheMapping = procfs::VmFlagHugetlb | procfs::VmFlagIo | procfs::VmFlagPfnMap;
+    return before.backing == Backing::file && before.vma.inode == vma.inode &&
+           before.vma.device() == vma.device() && before.vma.path == vma.path &&
+           (vma.flags & kOfTheMapping) == 0;
+}
+
+}  // namespace
+
 std::vector<BackedVma> backedVmas(std::vector<Vma>& vmas, ShmemDevices& shmemDevices, int processDirectory) {
     std::vector<BackedVma> backed;
     backed.reserve(vmas.size());
     for (Vma& vma : vmas) {
-        const Backing backing = backingOf(vma, shmemDevices, processDirectory);
+        // The parts of one library follow each other.
+        const bool goesOn = !backed.empty() && isSamePlainFile(backed.back(), vma);
+        const Backing backing = goesOn ? Backing::file : backingOf(vma, shmemDevices, processDirectory);
         backed.push_back({vma, backing});
     }
     return backed;

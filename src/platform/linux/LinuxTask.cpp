@@ -77,8 +77,13 @@ void LinuxRun::begin() {
     forkCensus.begin();
 }
 
-LinuxTask::LinuxTask(LinuxRun& run, int32_t pid)
-    : _run(run), _pid(pid), _directory(openDirectory(run.proc.get(), std::to_string(pid))), _threadId(pid) {}
+LinuxTask::LinuxTask(LinuxRun& run, int32_t pid, ListedProcess listed)
+    : _run(run),
+      _pid(pid),
+      _startTime(listed.stat.startTime),
+      _directory(std::move(listed.directory)),
+      _threadId(pid),
+      _stat(std::move(listed.stat)) {}
 
 LiveThread openLiveThread(int processDirectory) {
     LiveThread found;
@@ -98,21 +103,28 @@ bool hasLiveThread(int processDirectory) {
 }
 
 std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
-    std::unique_ptr<LinuxTask> task(new LinuxTask(run, pid));
-    const auto stat = task->_directory ? readStat(task->directory()) : std::nullopt;
+    ListedProcess listed;
+    listed.directory = openDirectory(run.proc.get(), std::to_string(pid));
+    const auto stat = listed.directory ? readStat(listed.directory.get()) : std::nullopt;
     if (!stat) {
         return nullptr;
     }
-    task->_startTime = stat->startTime;
-    task->_stat = *stat;
-    task->_chooseThread();
+    listed.stat = *stat;
+    procfs::readRecord(listed.directory.get(), "auxv", listed.auxv);
+    return open(run, pid, std::move(listed));
+}
+
+std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid, ListedProcess listed) {
+    std::string auxv = std::move(listed.auxv);
+    std::unique_ptr<LinuxTask> task(new LinuxTask(run, pid, std::move(listed)));
+    if (task->_stat.threadEnded() && task->_chooseThread()) {
+        procfs::readRecord(task->memoryDirectory(), "auxv", auxv);
+    }
     // Whoever may read auxv may read maps.
-    std::string auxv;
-    const bool read = procfs::readRecord(task->memoryDirectory(), "auxv", auxv) && !auxv.empty();
-    if (!read && !mayLook(task->memoryDirectory())) {
+    if (auxv.empty() && !mayLook(task->memoryDirectory())) {
         return nullptr;
     }
-    task->_program = read ? run.identity.bytes(auxv) : 0;
+    task->_program = auxv.empty() ? 0 : run.identity.bytes(auxv);
     if (run.mappingSource == MappingSource::cheapest) {
         task->_exec = randomBytesIdentifier(auxv, task->_threadId, run.identity);
     }

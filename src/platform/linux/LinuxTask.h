@@ -52,6 +52,13 @@ struct LinuxRun {
     bool seesFrames() const { return untouchedPage.frame() != 0; }
 };
 
+/// A process as the list of processes has shown it, for the task that is made of it next.
+struct ListedProcess {
+    procfs::Descriptor directory;
+    procfs::ProcStat stat;
+    std::string auxv;
+};
+
 struct LiveThread {
     int32_t identifier = 0;
     procfs::Descriptor directory;
@@ -69,6 +76,8 @@ public:
     /// None when there is no such process or the caller may not look at its memory. A process that has ended
     /// but is still there can be opened: its address space is then gone. `run` outlives the task.
     static std::unique_ptr<LinuxTask> open(LinuxRun& run, int32_t pid);
+    /// The same of a process that has been looked at a moment ago.
+    static std::unique_ptr<LinuxTask> open(LinuxRun& run, int32_t pid, ListedProcess listed);
     ~LinuxTask();
     LinuxTask(const LinuxTask&) = delete;
     LinuxTask& operator=(const LinuxTask&) = delete;
@@ -105,7 +114,7 @@ public:
     std::vector<OwnedObjectRecord> ownedObjects();
 
 private:
-    LinuxTask(LinuxRun& run, int32_t pid);
+    LinuxTask(LinuxRun& run, int32_t pid, ListedProcess listed);
 
     /// The directory to read memory through: that of a thread that lives.
     /// False when no thread of the process lives.

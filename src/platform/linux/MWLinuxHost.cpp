@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -45,6 +46,12 @@ private:
     const LinuxImage& _image;
 };
 
+// Of the tasks of all hosts there ever are.
+uint64_t newGeneration() {
+    static std::atomic<uint64_t> last = 0;
+    return ++last;
+}
+
 uint64_t readClock(clockid_t clock) {
     constexpr uint64_t kNanosecondsPerSecond = 1'000'000'000;
     timespec time = {};
@@ -56,20 +63,48 @@ uint64_t readClock(clockid_t clock) {
 
 MWLinuxHost::MWLinuxHost(const std::string& procDirectory, const std::string& sysDirectory,
                          MappingSource mappingSource)
-    : _run(procDirectory, mappingSource), _sys(procfs::open(AT_FDCWD, sysDirectory.c_str(), O_DIRECTORY)) {
+    : _tasksGeneration(newGeneration()),
+      _run(procDirectory, mappingSource),
+      _sys(procfs::open(AT_FDCWD, sysDirectory.c_str(), O_DIRECTORY)) {
     raiseDescriptorLimit();
 }
 
 MWLinuxHost::~MWLinuxHost() = default;
 
+// A walk asks about one task thousands of times in a row, on a thread of its own.
 LinuxTask* MWLinuxHost::_task(task_t task) {
-    const std::lock_guard lock(_tasksMutex);
-    const auto found = _tasks.find(task);
-    return found == _tasks.end() ? nullptr : found->second.get();
+    struct Answer {
+        uint64_t generation = 0;
+        task_t task = 0;
+        LinuxTask* record = nullptr;
+    };
+    thread_local Answer last;
+    const uint64_t generation = _tasksGeneration;
+    if (last.record == nullptr || last.task != task || last.generation != generation) {
+        const std::lock_guard lock(_tasksMutex);
+        const auto found = _tasks.find(task);
+        last = {.generation = generation,
+                .task = task,
+                .record = found == _tasks.end() ? nullptr : found->second.get()};
+    }
+    return last.record;
+}
+
+void MWLinuxHost::_forgetListed() {
+    const std::lock_guard lock(_listedMutex);
+    _listed.clear();
+}
+
+std::optional<ListedProcess> MWLinuxHost::_takeListed(int32_t pid) {
+    const std::lock_guard lock(_listedMutex);
+    auto found = _listed.extract(pid);
+    return found.empty() ? std::nullopt : std::optional(std::move(found.mapped()));
 }
 
 kern_return_t MWLinuxHost::task_read_for_pid(int32_t pid, task_t& task) {
-    std::unique_ptr<LinuxTask> opened = LinuxTask::open(_run, pid);
+    auto listed = _takeListed(pid);
+    std::unique_ptr<LinuxTask> opened =
+        listed ? LinuxTask::open(_run, pid, *std::move(listed)) : LinuxTask::open(_run, pid);
     if (opened == nullptr) {
         return errno == EMFILE || errno == ENFILE ? KERN_RESOURCE_SHORTAGE : KERN_FAILURE;
     }
@@ -80,6 +115,7 @@ kern_return_t MWLinuxHost::task_read_for_pid(int32_t pid, task_t& task) {
     task = _lastTask;
     _tasks.emplace(task, std::move(opened));
     _tasksByPid.emplace(pid, task);
+    _tasksGeneration = newGeneration();
     return KERN_SUCCESS;
 }
 
@@ -89,6 +125,7 @@ void MWLinuxHost::task_release(task_t task) {
     if (found != _tasks.end()) {
         _tasksByPid.erase({found->second->pid(), task});
         _tasks.erase(found);
+        _tasksGeneration = newGeneration();
     }
 }
 
@@ -170,7 +207,21 @@ kern_return_t MWLinuxHost::mach_vm_page_range_query(task_t task, uint64_t start,
 // Two records of one pid live at once only while sampling replaces one by the other; the newer one is being
 // walked then.
 LinuxTask* MWLinuxHost::_taskOfPid(int32_t pid) {
-    const std::lock_guard lock(_tasksMutex);
+    struct Answer {
+        uint64_t generation = 0;
+        int32_t pid = 0;
+        LinuxTask* record = nullptr;
+    };
+    thread_local Answer last;
+    const uint64_t generation = _tasksGeneration;
+    if (last.record == nullptr || last.pid != pid || last.generation != generation) {
+        const std::lock_guard lock(_tasksMutex);
+        last = {.generation = generation, .pid = pid, .record = _newestTaskOfPid(pid)};
+    }
+    return last.record;
+}
+
+LinuxTask* MWLinuxHost::_newestTaskOfPid(int32_t pid) const {
     const auto above = _tasksByPid.upper_bound({pid, UINT32_MAX});
     if (above == _tasksByPid.begin() || std::prev(above)->first != pid) {
         return nullptr;
@@ -205,6 +256,11 @@ void MWLinuxHost::forEachImage(task_t task, const std::function<void(const MWIma
     for (const LinuxImage& image : record->addressSpace().images()) {
         block(LinuxImageDescription(image));
     }
+}
+
+void MWLinuxHost::beginOwnedVmObjectSurvey() {
+    _forgetListed();
+    _run.begin();
 }
 
 void MWLinuxHost::surveyOwnedVmObjects(task_t task) {

@@ -64,7 +64,7 @@ public:
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
 
-    void beginOwnedVmObjectSurvey() override { _run.begin(); }
+    void beginOwnedVmObjectSurvey() override;
     void surveyOwnedVmObjects(task_t task) override;
     /// What the process holds through descriptors, and its SysV segments that nobody has attached.
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
@@ -100,8 +100,11 @@ public:
     void unlinkRegularFile(const std::string& path) override;
 
 private:
+    void _forgetListed();
+    std::optional<ListedProcess> _takeListed(int32_t pid);
     LinuxTask* _task(task_t task);
     LinuxTask* _taskOfPid(int32_t pid);
+    LinuxTask* _newestTaskOfPid(int32_t pid) const;
     /// From the task's snapshot, which is taken when there is none; `code` says why there is no region.
     const AddressSpaceRegion* _regionAtOrAbove(task_t task, uint64_t address, kern_return_t& code);
     /// The process's directory: the one that a task of this pid holds open, else opened anew into `opened`.
@@ -115,9 +118,13 @@ private:
     template <class Record>
     std::span<const Record> _handOver(const std::vector<Record>& records);
 
+    std::atomic<uint64_t> _tasksGeneration;  ///< changes when the tables of tasks do
     LinuxRun _run;
     procfs::Descriptor _sys;
     std::atomic<int32_t> _selfRegionMemweight = 0;
+
+    std::mutex _listedMutex;  ///< guards what follows
+    std::map<int32_t, ListedProcess> _listed;
 
     std::mutex _tasksMutex;  ///< guards the table; a task itself is one thread's at a time
     std::map<task_t, std::unique_ptr<LinuxTask>> _tasks;

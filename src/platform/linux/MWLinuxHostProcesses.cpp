@@ -108,6 +108,7 @@ std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
 }
 
 int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
+    _forgetListed();
     const std::vector<int32_t> entries = numericEntries(_run.proc.get());
     if (entries.empty()) {
         return -1;
@@ -156,9 +157,16 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     copyText(record.pbi_comm, stat->comm);
     procfs::readRecord(directory, "cmdline", text);
     copyText(record.pbi_name, procfs::nameFromCommandLine(text));
-    procfs::readRecord(directory, "auxv", text);
-    const std::optional<bool> is64bit = procfs::auxvIs64bit(text);
+    ListedProcess listed;
+    listed.directory = std::move(opened);
+    listed.stat = *stat;
+    procfs::readRecord(directory, "auxv", listed.auxv);
+    const std::optional<bool> is64bit = procfs::auxvIs64bit(listed.auxv);
     record.pbi_flags = (is64bit ? *is64bit : executableIs64bit(directory)) ? PROC_FLAG_LP64 : 0;
+    if (listed.directory) {
+        const std::lock_guard lock(_listedMutex);
+        _listed.insert_or_assign(pid, std::move(listed));
+    }
     return sizeof(record);
 }
 

@@ -111,8 +111,16 @@ std::optional<MappingCounts> countWithoutSmaps(std::vector<BackedVma>& vmas, con
         return std::nullopt;
     }
     auto filePages = countPages(vmas, process.scan);
+    const Vma* lastClean = nullptr;
     const auto isClean = [&](const BackedVma& backed) {
-        return !hasFilePages(backed) || uncounted.isCleanFile(process.memoryDirectory, backed.vma);
+        const Vma& vma = backed.vma;
+        const bool goesOn =
+            lastClean != nullptr && lastClean->inode == vma.inode && lastClean->device() == vma.device();
+        if (!hasFilePages(backed) || goesOn) {
+            return true;
+        }
+        lastClean = &vma;
+        return uncounted.isCleanFile(process.memoryDirectory, vma);
     };
     if (!filePages || !agreesOnSwap(vmas, process.status.vmSwap) || imagesNeedFlags(vmas) ||
         !std::ranges::all_of(vmas, isClean)) {

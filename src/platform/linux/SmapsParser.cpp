@@ -2,6 +2,7 @@
 
 #include <array>
 #include <cerrno>
+#include <memory>
 #include <utility>
 
 #include "platform/linux/ProcText.h"
@@ -183,15 +184,15 @@ void SmapsParser::_parseField(std::string_view line) {
 // of text at a time and lets go of the process's memory map in between.
 bool readMappings(int processDirectory, const char* file, std::vector<Vma>& vmas) {
     constexpr size_t kBufferSize = 256U << 10U;
-    thread_local std::array<char, kBufferSize> buffer;
+    thread_local const std::unique_ptr<char[]> buffer(new char[kBufferSize]);
     const Descriptor text = open(processDirectory, file);
     if (!text) {
         return false;
     }
     SmapsParser parser(std::move(vmas));
     ptrdiff_t count = 0;
-    while ((count = readSome(text.get(), buffer)) > 0) {
-        parser.feed({buffer.data(), static_cast<size_t>(count)});
+    while ((count = readSome(text.get(), {buffer.get(), kBufferSize})) > 0) {
+        parser.feed({buffer.get(), static_cast<size_t>(count)});
     }
     const int error = errno;
     vmas = parser.finish();
