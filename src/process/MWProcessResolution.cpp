@@ -111,7 +111,12 @@ std::optional<std::string> executableNameOfPid(int32_t pid) {
         return std::nullopt;
     }
     // Megabytes of which a few hundred bytes get used: the buffer stays untouched where nothing is written.
-    const std::unique_ptr<char[]> buffer(new (std::nothrow) char[maximum]);
+    thread_local std::unique_ptr<char[]> buffer;
+    thread_local uint64_t room = 0;
+    if (room < maximum) {
+        buffer.reset(new (std::nothrow) char[maximum]);
+        room = buffer == nullptr ? 0 : maximum;
+    }
     size_t length = 0;
     if (buffer == nullptr || host.sysctlArgumentArea(pid, {buffer.get(), maximum}, length) != 0) {
         return std::nullopt;
@@ -140,11 +145,14 @@ std::optional<int64_t> leadingInteger(std::string_view text) {
 }
 
 /// Matches descriptions against one snapshot. A process's name costs a read of its argument area, so it is
-/// read when first needed and then kept for the snapshot's life.
+/// read once for the snapshot's life.
 class DescriptionMatcher {
 public:
     explicit DescriptionMatcher(const ProcessSnapshot& snapshot)
-        : _snapshot(snapshot), _names(snapshot.size()) {}
+        : _snapshot(snapshot), _names(snapshot.size()) {
+        forEachIndex(_names.size(),
+                     [&](size_t index) { _names[index] = MWProcess::_nameForBsdInfo(_snapshot[index]); });
+    }
 
     /// Adds what `description` selects to `pids`; false when that is nothing.
     bool match(const std::string& description, MWPidMap& pids) {
@@ -152,7 +160,7 @@ public:
         bool matched = false;
         for (size_t index = 0; index < _snapshot.size(); ++index) {
             const int32_t pid = pidOf(_snapshot[index]);
-            if (_name(index) == description) {
+            if (_names[index] == description) {
                 pids[pid] = description;
                 matched = true;
             } else if (number == pid) {
@@ -164,15 +172,8 @@ public:
     }
 
 private:
-    const std::string& _name(size_t index) {
-        if (!_names[index]) {
-            _names[index] = MWProcess::_nameForBsdInfo(_snapshot[index]);
-        }
-        return *_names[index];
-    }
-
     const ProcessSnapshot& _snapshot;
-    std::vector<std::optional<std::string>> _names;
+    std::vector<std::string> _names;
 };
 
 /// Parent to the places of its children in the snapshot.

@@ -146,8 +146,8 @@ TEST(MWUserProcessSharedCacheTest, ListsImagesBySegment) {
                             "190000000+10 __DATA_CONST 3 /lib/cached"}));
 
     const MWImageList other = InspectedProcess::of(8)->listImages();
-    EXPECT_EQ(&other[5].ownerPath(), &listed[6].ownerPath()) << "one text for all processes";
-    EXPECT_EQ(&other[6].name(), &listed[6].name());
+    EXPECT_EQ(other[5].ownerPath().get(), listed[6].ownerPath().get()) << "one text for all processes";
+    EXPECT_EQ(other[6].name().get(), listed[6].name().get());
 }
 
 }  // namespace

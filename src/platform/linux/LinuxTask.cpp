@@ -111,10 +111,19 @@ std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
     }
     listed.stat = *stat;
     procfs::readRecord(listed.directory.get(), "auxv", listed.auxv);
-    return open(run, pid, std::move(listed));
+    return _openLookedAt(run, pid, std::move(listed));
 }
 
 std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid, ListedProcess listed) {
+    std::string commandLine = std::move(listed.commandLine);
+    auto task = _openLookedAt(run, pid, std::move(listed));
+    if (task != nullptr) {
+        task->_commandLine = std::move(commandLine);
+    }
+    return task;
+}
+
+std::unique_ptr<LinuxTask> LinuxTask::_openLookedAt(LinuxRun& run, int32_t pid, ListedProcess listed) {
     std::string auxv = std::move(listed.auxv);
     std::unique_ptr<LinuxTask> task(new LinuxTask(run, pid, std::move(listed)));
     if (task->_stat.threadEnded() && task->_chooseThread()) {

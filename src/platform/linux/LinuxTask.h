@@ -57,6 +57,7 @@ struct ListedProcess {
     procfs::Descriptor directory;
     procfs::ProcStat stat;
     std::string auxv;
+    std::string commandLine;
 };
 
 struct LiveThread {
@@ -85,6 +86,8 @@ public:
     int32_t pid() const { return _pid; }
     /// /proc/PID, opened with O_PATH.
     int directory() const { return _directory.get(); }
+    /// As the list of processes showed it; none when the process was not listed.
+    const std::optional<std::string>& commandLine() const { return _commandLine; }
     /// The same, or /proc/PID/task/TID of a thread that lives where the first one has ended.
     int memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
 
@@ -115,6 +118,7 @@ public:
 
 private:
     LinuxTask(LinuxRun& run, int32_t pid, ListedProcess listed);
+    static std::unique_ptr<LinuxTask> _openLookedAt(LinuxRun& run, int32_t pid, ListedProcess listed);
 
     /// The directory to read memory through: that of a thread that lives.
     /// False when no thread of the process lives.
@@ -142,8 +146,9 @@ private:
     int32_t _pid;
     uint64_t _startTime = 0;
     procfs::Descriptor _directory;
-    int32_t _threadId;              ///< a thread that lives
-    procfs::Descriptor _thread;     ///< its task/TID, when it is not the first one
+    int32_t _threadId;           ///< a thread that lives
+    procfs::Descriptor _thread;  ///< its task/TID, when it is not the first one
+    std::optional<std::string> _commandLine;
     procfs::ProcStat _stat;         ///< of that thread, as last seen
     uint64_t _program = 0;          ///< stands for its auxv, which each exec makes anew; 0 for none
     std::optional<uint64_t> _exec;  ///< see randomBytesIdentifier

@@ -155,9 +155,9 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     record.pbi_status = statusOf(*stat, directory);
     setStartTime(record, stat->startTime);
     copyText(record.pbi_comm, stat->comm);
-    procfs::readRecord(directory, "cmdline", text);
-    copyText(record.pbi_name, procfs::nameFromCommandLine(text));
     ListedProcess listed;
+    procfs::readRecord(directory, "cmdline", listed.commandLine);
+    copyText(record.pbi_name, procfs::nameFromCommandLine(listed.commandLine));
     listed.directory = std::move(opened);
     listed.stat = *stat;
     procfs::readRecord(directory, "auxv", listed.auxv);
@@ -186,26 +186,45 @@ int MWLinuxHost::proc_get_dirty(int32_t, uint32_t& flags) {
 }
 
 int MWLinuxHost::sysctlArgumentMaximum(uint64_t& bytes) {
-    const long maximum = sysconf(_SC_ARG_MAX);
+    static const long maximum = sysconf(_SC_ARG_MAX);
     bytes = static_cast<uint64_t>(std::max(maximum, 0L));
     return maximum > 0 ? 0 : -1;
+}
+
+// The arguments of a process that was listed a moment ago are those that it had then.
+bool MWLinuxHost::_readArguments(int32_t pid, std::string& executable, std::string& arguments) {
+    if (const LinuxTask* task = _taskOfPid(pid); task != nullptr && task->commandLine()) {
+        arguments = *task->commandLine();
+        return procfs::readLink(task->directory(), "exe", executable);
+    }
+    {
+        const std::lock_guard lock(_listedMutex);
+        if (const auto listed = _listed.find(pid); listed != _listed.end()) {
+            arguments = listed->second.commandLine;
+            return procfs::readLink(listed->second.directory.get(), "exe", executable);
+        }
+    }
+    procfs::Descriptor opened;
+    const int directory = _processDirectory(pid, opened);
+    if (directory < 0 || !procfs::readLink(directory, "exe", executable)) {
+        return false;
+    }
+    procfs::readRecord(directory, "cmdline", arguments);
+    return true;
 }
 
 // The argument count, the executable's path, then the arguments. An executable that was replaced while it ran
 // keeps its name without the mark that the kernel adds.
 int MWLinuxHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) {
-    procfs::Descriptor opened;
-    const int directory = _processDirectory(pid, opened);
     std::string path;
     std::string arguments;
-    if (directory < 0 || !procfs::readLink(directory, "exe", path)) {
+    if (!_readArguments(pid, path, arguments)) {
         return -1;
     }
     constexpr std::string_view kDeleted = " (deleted)";
     if (path.ends_with(kDeleted)) {
         path.resize(path.size() - kDeleted.size());
     }
-    procfs::readRecord(directory, "cmdline", arguments);
     const auto count = static_cast<int32_t>(std::count(arguments.begin(), arguments.end(), '\0'));
     std::string bytes(sizeof(count), '\0');
     std::memcpy(bytes.data(), &count, sizeof(count));
