@@ -73,6 +73,15 @@ std::vector<int32_t> numericEntries(int procDirectory) {
     return pids;
 }
 
+// The kernel enlarges the table of a program's descriptors when one does not fit. Once there are threads it
+// then waits until no processor can be looking at the old table any more, which takes as long as to measure a
+// hundred processes; so it is enlarged before, to hold a descriptor for each process.
+void makeRoomForDescriptors(size_t processes) {
+    constexpr size_t kOthers = 64;
+    const int last = fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, static_cast<int>(processes + kOthers));
+    procfs::Descriptor(last).reset();
+}
+
 }  // namespace
 
 int MWLinuxHost::_processDirectory(int32_t pid, procfs::Descriptor& opened) {
@@ -113,6 +122,7 @@ int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
     if (entries.empty()) {
         return -1;
     }
+    makeRoomForDescriptors(entries.size());
     if (pids.empty()) {
         return static_cast<int>(entries.size() + 1);
     }
