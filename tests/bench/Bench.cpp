@@ -45,7 +45,7 @@ double milliseconds(const timeval& time) {
     return static_cast<double>(time.tv_sec) * 1e3 + static_cast<double>(time.tv_usec) / 1e3;
 }
 
-Usage run(const Command& command) {
+Usage runCommand(const Command& command) {
     std::vector<char*> arguments;
     for (const std::string& argument : command) {
         arguments.push_back(const_cast<char*>(argument.c_str()));
@@ -92,13 +92,13 @@ struct Pair {
 
 /// One after the other, again and again, so that both meet the same moods of the machine.
 Pair interleaved(const Command& own, const Command& other) {
-    run(own);
-    run(other);
+    runCommand(own);
+    runCommand(other);
     std::vector<Usage> ofOwn;
     std::vector<Usage> ofOther;
     for (int pair = 0; pair < kPairs; ++pair) {
-        ofOwn.push_back(run(own));
-        ofOther.push_back(run(other));
+        ofOwn.push_back(runCommand(own));
+        ofOther.push_back(runCommand(other));
     }
     const auto medians = [](const std::vector<Usage>& usages) {
         return Usage{medianOf(usages, &Usage::wall), medianOf(usages, &Usage::cpu),
@@ -169,13 +169,20 @@ public:
     Bench(const Bench&) = delete;
     Bench& operator=(const Bench&) = delete;
 
-    bool runAll() {
-        _manySmallProcesses();
-        _manyMoreProcesses();
-        _manyMappings();
-        _muchMemory();
-        _family();
-        _stall();
+    /// Those whose names hold `part`.
+    bool run(const std::string& part) {
+        const std::vector<std::pair<std::string, void (Bench::*)()>> parts = {
+            {"small", &Bench::_manySmallProcesses},
+            {"more", &Bench::_manyMoreProcesses},
+            {"mappings", &Bench::_manyMappings},
+            {"large", &Bench::_muchMemory},
+            {"family", &Bench::_family},
+            {"stall", &Bench::_stall}};
+        for (const auto& [name, measure] : parts) {
+            if (name.find(part) != std::string::npos) {
+                (this->*measure)();
+            }
+        }
         return _table.met();
     }
 
@@ -183,9 +190,9 @@ public:
         for (const size_t count : {10, 100, 1000, 4000}) {
             const Population population = Population::ofProcesses(count, 17, kMiB);
             std::vector<Usage> usages;
-            run(_all());
+            runCommand(_all());
             for (int time = 0; time < kPairs; ++time) {
-                usages.push_back(run(_all()));
+                usages.push_back(runCommand(_all()));
             }
             std::printf("%5zu processes, %6zu mappings: %8.1f ms, %8.1f ms CPU, %6.1f MiB\n", count,
                         mappingsOf(population.pids()), medianOf(usages, &Usage::wall),
@@ -271,9 +278,9 @@ private:
         std::vector<Usage> more;
         const auto measure = [&](size_t count, std::vector<Usage>& usages) {
             const Population population = Population::ofProcesses(count, 17, kMiB);
-            run(_all());
+            runCommand(_all());
             for (int time = 0; time < kPairs; ++time) {
-                usages.push_back(run(_all()));
+                usages.push_back(runCommand(_all()));
             }
             return mappingsOf(population.pids());
         };
@@ -318,7 +325,7 @@ private:
             usleep(100'000);
             undisturbed.push_back(process.slowestMilliseconds());
             process.restart();
-            run(_of({process.pid()}));
+            runCommand(_of({process.pid()}));
             measured.push_back(process.slowestMilliseconds());
         }
         _table.addFigure("4 GiB, mapping in a loop: longest stall beyond the usual",
@@ -366,7 +373,9 @@ void coverLazilyFreed() {
 int main(int argc, char* argv[]) {
     runAsWorker(argc, argv);
     if (argc < 2 || geteuid() != 0) {
-        fail("as root: memweight_bench MEMWEIGHT [--scale] [--as-is]");
+        fail(
+            "as root: memweight_bench MEMWEIGHT [--scale] [--as-is] "
+            "[--only=small|more|mappings|large|family|stall]");
     }
     const std::vector<std::string> options(argv + 2, argv + argc);
     const auto has = [&](const char* option) {
@@ -381,5 +390,8 @@ int main(int argc, char* argv[]) {
         bench.runScale();
         return 0;
     }
-    return bench.runAll() ? 0 : 1;
+    constexpr std::string_view kOnly = "--only=";
+    const auto only = std::find_if(options.begin(), options.end(),
+                                   [=](const std::string& option) { return option.starts_with(kOnly); });
+    return bench.run(only == options.end() ? "" : only->substr(kOnly.size())) ? 0 : 1;
 }
