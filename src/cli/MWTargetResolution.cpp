@@ -48,6 +48,11 @@ MWError secondProcessOfPid(int32_t pid) {
                                        pid));
 }
 
+// Excluded processes are measured then, and descendants are left out.
+void reportNoProcessList() {
+    std::fputs("Unable to obtain system process list\n", stderr);
+}
+
 void reportUnreadable(int32_t pid, const std::optional<std::string>& name) {
     if (name) {
         fmt::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", MWTerminalText(*name),
@@ -157,6 +162,9 @@ std::set<int32_t> MWMemweightArgs::_exclusions() const {
     }
     if (!_excludedPidsOrProcesses.empty()) {
         const auto excluded = MWProcess::pidsForStringDescriptions(listOf(_excludedPidsOrProcesses), nullptr);
+        if (!excluded) {
+            reportNoProcessList();
+        }
         for (const int32_t pid : pidsOf(excluded.value_or(MWPidMap{}))) {
             exclusions.insert(pid);
         }
@@ -188,6 +196,9 @@ void MWMemweightArgs::_excludeTargets(const std::set<int32_t>& exclusions) {
 
 void MWMemweightArgs::_addDescendants() {
     const auto family = MWProcess::childPidsForPids(pidsOf(_targetPids));
+    if (!family) {
+        reportNoProcessList();
+    }
     for (const int32_t pid : family.value_or(std::vector<int32_t>{})) {
         _targetPids[pid] = std::nullopt;
     }

@@ -144,8 +144,9 @@ bool MWUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t startAddre
             _processMachVMError(result, {.expectingErrorOnExit = KERN_INVALID_ARGUMENT});
             return false;
         }
-        query.block(
-            {.words = std::span(words).first(std::min(count, asked)), .index = index, .count = chunks});
+        // A page that nothing is told of is absent: those behind it keep their places.
+        std::fill(words.begin() + static_cast<ptrdiff_t>(std::min(count, asked)), words.end(), 0);
+        query.block({.words = std::span(words).first(asked), .index = index, .count = chunks});
     }
     return true;
 }

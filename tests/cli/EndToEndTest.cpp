@@ -20,6 +20,7 @@
 #include <thread>
 #include <utility>
 
+#include "platform/linux/Procfs.h"
 #include "support/ChildProcess.h"
 
 // The built tool, run on real processes whose memory the test knows.
@@ -184,6 +185,10 @@ protected:
 };
 
 TEST_F(SavedProcesses, AreReportedLikeTheLivingOnes) {
+    // Pages of a program that has just been linked are dirty until they are written, be it between the two
+    // looks.
+    const procfs::Descriptor program = procfs::open(AT_FDCWD, "/proc/self/exe");
+    ASSERT_EQ(fsync(program.get()), 0);
     const int memfd = memfd_create("end-to-end", 0);
     ASSERT_EQ(ftruncate(memfd, 64 * kPage), 0);
     const ChildProcess low([=] { return touchPages(memfd, 0, 30); });

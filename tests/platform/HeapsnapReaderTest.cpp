@@ -9,11 +9,9 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <random>
 #include <string>
 #include <vector>
 
-#include "platform/HeapsnapFuzz.h"
 #include "support/RecordedTree.h"
 
 namespace {
@@ -169,39 +167,6 @@ TEST_F(HeapsnapFile, OnlyFilesAreOpenedAndOnlyWhatIsNeededIsRead) {
     write("sparse", "{");
     std::filesystem::resize_file(place("sparse"), uint64_t{10} << 30U);
     EXPECT_EQ(refusalOf(place("sparse")), "HeapsnapReaderError: not valid JSON at byte 2");
-}
-
-// Small changes of documents that are read: what a fuzzer without instruments can do.
-TEST(HeapsnapReader, AnyBytesAreReadOrRefused) {
-    std::mt19937 random(7);
-    std::vector<std::string> corpus;
-    for (const auto& entry : std::filesystem::directory_iterator(kCorpus)) {
-        corpus.push_back(textOf(entry.path().filename()));
-    }
-    ASSERT_FALSE(corpus.empty());
-    std::ranges::sort(corpus);
-    const std::string pieces[] = {"{", "}", "[", "]", ",", ":", "\"", "-", "1e9", "null", "\"start\":"};
-    for (int round = 0; round < 20000; ++round) {
-        std::string text = corpus[random() % corpus.size()];
-        for (unsigned change = random() % 4; change != 0; --change) {
-            const size_t at = random() % text.size();
-            const size_t length = random() % 8;
-            switch (random() % 4) {
-                case 0:
-                    text[at] = static_cast<char>(random());
-                    break;
-                case 1:
-                    text.erase(at, length);
-                    break;
-                case 2:
-                    text.insert(at, pieces[random() % std::size(pieces)]);
-                    break;
-                default:
-                    text.insert(at, text.substr(random() % text.size(), 16 * length));
-            }
-        }
-        LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t*>(text.data()), text.size());
-    }
 }
 
 }  // namespace

@@ -2,6 +2,7 @@
 
 #include <string>
 
+#include "platform/linux/ForkFamily.h"
 #include "platform/linux/MWLinuxHost.h"
 #include "platform/linux/Procfs.h"
 #include "platform/linux/ShmemDevices.h"
@@ -20,9 +21,10 @@ protected:
     }
 };
 
-std::string statOf(int pid, char state, uint64_t flags, int threads) {
-    return std::to_string(pid) + " (x) " + state + " 1 1 1 0 -1 " + std::to_string(flags) +
-           " 0 0 0 0 0 0 0 0 20 0 " + std::to_string(threads) + " 0 500 0 0 0 1 2 3 0 0\n";
+std::string statOf(int pid, char state, uint64_t flags, int threads, int parent = 1) {
+    return std::to_string(pid) + " (x) " + state + " " + std::to_string(parent) + " 1 1 0 -1 " +
+           std::to_string(flags) + " 0 0 0 0 0 0 0 0 20 0 " + std::to_string(threads) +
+           " 0 500 0 0 0 1 2 3 0 0\n";
 }
 
 kern_return_t walkOf(MWLinuxHost& host, int32_t pid) {
@@ -59,6 +61,29 @@ TEST_F(RecordedProc, AProcessIsReadThroughAThreadThatLives) {
                  "1000-3000 rw-p 00000000 00:00 0\nRss: 8 kB\nAnonymous: 8 kB\nPrivate_Dirty: 8 kB\n");
     MWLinuxHost host(_top);
     EXPECT_EQ(walkOf(host, 20), KERN_SUCCESS);
+}
+
+TEST_F(RecordedProc, ParentsThatLeadBackToTheirChildrenAreNoEndlessChain) {
+    const auto family = [this](int32_t pid) {
+        return forkFamilyIdentifier(directory("").get(), directory(std::to_string(pid)).get(), pid,
+                                    ObjectIdentity("boot"));
+    };
+    // Beyond the largest pid: nothing is read of a real process.
+    const auto writeChild = [this](int32_t pid, int32_t parent, const char* executable) {
+        const std::string name = std::to_string(pid);
+        write(name + "/stat", statOf(pid, 'S', 0, 1, parent));
+        if (executable != nullptr) {
+            link(name + "/exe", executable);
+        }
+    };
+    writeChild(5000001, 5000002, "/bin/server");
+    writeChild(5000002, 5000001, "/bin/server");
+    EXPECT_NE(family(5000001), 0U);
+    writeChild(5000003, 5000004, "/bin/server");
+    writeChild(5000004, 5000005, "/bin/server");
+    writeChild(5000005, 1, nullptr);
+    EXPECT_EQ(family(5000003), family(5000004));
+    EXPECT_NE(family(5000004), family(5000005)) << "nobody knows what that one runs";
 }
 
 TEST_F(RecordedProc, WhatOneProcessDoesNotSeeAnotherMayHaveMounted) {

@@ -39,6 +39,7 @@ public:
     void setPageTables(uint64_t bytes) { _ledgers[0] = bytes; }
 
     using MWUserProcess::_addSubrangesForRegion;
+    using MWUserProcess::_enumerateDispositionChunksWithStartAddr;
     using MWUserProcess::_populateMemoryRegionWithPageQueries;
     using MWUserProcess::_setSharedRegionFromPlatform;
     using MWUserProcess::enumerateRegions;

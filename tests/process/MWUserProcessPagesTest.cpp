@@ -1,9 +1,11 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <tuple>
 #include <vector>
 
 #include "process/InspectedProcess.h"
+#include "support/FaultyHost.h"
 
 namespace {
 
@@ -150,6 +152,22 @@ TEST(MWUserProcessPagesTest, SubrangesNeverWrapAroundTheObject) {
     one->setOffset(UINT64_MAX - 0x2000);
     InspectedProcess::of(7)->_addSubrangesForRegion(*one, VM_PURGABLE_DENY);
     EXPECT_EQ(one->subrangeList(), nullptr);
+}
+
+TEST(MWUserProcessPagesTest, PagesOfWhichNothingIsToldAreAbsentAndMoveNoOthers) {
+    // More than one query's pages, of which all are dirty; the first answer is cut in half.
+    constexpr uint64_t kPage = 4096;
+    constexpr uint64_t kPagesPerQuery = 4096;
+    World world(std::vector<int32_t>(kPagesPerQuery + 8, kDirty), kPage);
+    FaultyHost host(world.host, HostFault{{"mach_vm_page_range_query", 7}, FaultKind::isHalf});
+    const auto process = InspectedProcess::of(7);
+    std::vector<uint64_t> told;
+    EXPECT_TRUE(process->_enumerateDispositionChunksWithStartAddr(
+        0x40000, {.pagesToQuery = kPagesPerQuery + 8, .block = [&](const MWDispositionChunk& chunk) {
+                      told.push_back(chunk.words.size());
+                      told.push_back(static_cast<uint64_t>(std::ranges::count(chunk.words, kDirty)));
+                  }}));
+    EXPECT_EQ(told, (std::vector<uint64_t>{kPagesPerQuery, kPagesPerQuery / 2, 8, 8}));
 }
 
 }  // namespace

@@ -7,6 +7,7 @@
 #include <bit>
 #include <cstring>
 #include <numeric>
+#include <set>
 #include <string>
 
 #include "platform/linux/ProcText.h"
@@ -48,23 +49,27 @@ bool hasRandomAddresses(uint64_t stackAddress) {
     return !std::has_single_bit((stackAddress | (kLargestArguments - 1)) + 1);
 }
 
-// The oldest process of the chain of parents, beginning with `pid`, that runs the same executable.
-uint64_t oldestOfChain(int procDirectory, int32_t pid, const ObjectIdentity& identity) {
+// The oldest process of the chain of parents, beginning with `first`, that runs the same executable. Pids
+// that are given away while the chain is followed can lead back into it.
+uint64_t oldestOfChain(int procDirectory, int32_t first, const ObjectIdentity& identity) {
     std::string executable;
-    std::string parentExecutable;
+    std::string text;
     procfs::ProcStat oldest;
-    procfs::readLink(procDirectory, (std::to_string(pid) + "/exe").c_str(), executable);
-    while (pid != 0) {
-        std::string text;
+    std::set<int32_t> met;
+    for (int32_t pid = first; pid != 0 && met.insert(pid).second; pid = oldest.ppid) {
         const std::string directory = std::to_string(pid);
+        const bool known = procfs::readLink(procDirectory, (directory + "/exe").c_str(), text);
+        if (pid == first) {
+            executable = known ? text : "";
+        } else if (!known || text != executable) {
+            break;
+        }
         procfs::readFile(procDirectory, (directory + "/stat").c_str(), text);
         const auto stat = procfs::parseStat(text);
-        procfs::readLink(procDirectory, (directory + "/exe").c_str(), parentExecutable);
-        if (!stat || parentExecutable != executable) {
+        if (!stat) {
             break;
         }
         oldest = *stat;
-        pid = stat->ppid;
     }
     return identity.process(oldest.pid, oldest.startTime, 0);
 }

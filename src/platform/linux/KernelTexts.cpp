@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <array>
+#include <climits>
 #include <optional>
 
 #include "platform/MWSizeMath.h"
@@ -52,7 +53,8 @@ std::optional<SlabCache> parseSlabRow(std::string_view line) {
     const auto size = numberOf(takeLastWord(head));
     takeLastWord(head);
     const auto active = numberOf(takeLastWord(head));
-    head = head.substr(0, head.find_last_not_of(' ') + 1);
+    skipBlanks(head);
+    head = head.substr(0, head.find_last_not_of(" \t") + 1);
     if (!allSlabs || !pagesPerSlab || !size || !active || head.empty()) {
         return std::nullopt;
     }
@@ -64,7 +66,8 @@ std::optional<SlabCache> parseSlabRow(std::string_view line) {
 }
 
 bool isCall(std::string_view word) {
-    return word.find("+0x") != std::string_view::npos || word.starts_with("0x");
+    const size_t offset = word.find("+0x");
+    return (offset != 0 && offset != std::string_view::npos) || word.starts_with("0x");
 }
 
 // "NAME SIZE ..."
@@ -85,16 +88,14 @@ std::optional<AllocationSite> parseAllocation(std::string_view line) {
         module = function.substr(1, function.find(']') - 1);
         function = takeWord(line);
     }
-    const size_t colon = place.rfind(':');
-    if (!bytes || colon == std::string_view::npos || !takePrefix(function, "func:")) {
+    const size_t colon = std::min(place.rfind(':'), place.size());
+    const auto number = numberOf(place.substr(std::min(colon + 1, place.size())));
+    if (!bytes || !number || !takePrefix(function, "func:")) {
         return std::nullopt;
     }
-    int number = 0;
-    std::string_view digits = place.substr(colon + 1);
-    takeNumber(digits, number);
     return AllocationSite{.bytes = *bytes,
                           .file = std::string(place.substr(0, colon)),
-                          .line = number,
+                          .line = static_cast<int>(std::min<uint64_t>(*number, INT_MAX)),
                           .module = std::string(module),
                           .function = std::string(function)};
 }
@@ -154,17 +155,19 @@ std::vector<SlabCache> parseSlabinfo(std::string_view text) {
 }
 
 std::string VmallocCaller::function() const {
-    const size_t offset = call.find("+0x");
-    return offset == std::string::npos ? "" : call.substr(0, offset);
+    const std::string word = call.substr(0, call.find(' '));
+    const size_t offset = word.find("+0x");
+    return offset == std::string::npos ? "" : word.substr(0, offset);
 }
 
 std::string VmallocCaller::name() const {
     const size_t module = call.find(" [");
-    return function() + (module == std::string::npos ? "" : call.substr(module));
+    const std::string plain = function();
+    return plain.empty() || module == std::string::npos ? plain : plain + call.substr(module);
 }
 
 uint64_t VmallocCaller::address() const {
-    std::string_view digits = call;
+    std::string_view digits = std::string_view(call).substr(0, call.find(' '));
     return takePrefix(digits, "0x") ? numberOf(digits, 16).value_or(0) : 0;
 }
 
@@ -179,7 +182,7 @@ std::map<VmallocCaller, uint64_t> parseVmallocinfo(std::string_view text) {
         for (std::string_view word = takeWord(line); !word.empty(); word = takeWord(line)) {
             if (caller.call.empty() && isCall(word)) {
                 caller.call = word;
-            } else if (word.starts_with('[')) {
+            } else if (!caller.call.empty() && word.starts_with('[')) {
                 caller.call += " " + std::string(word);
             } else if (takePrefix(word, "pages=")) {
                 uint64_t& sum = pages[caller];

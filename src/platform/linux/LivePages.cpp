@@ -99,8 +99,9 @@ uint64_t LivePages::nextPopulated(uint64_t address, uint64_t end) {
         std::array<ScannedRange, 1> found = {};
         const uint64_t limit = std::min(end, start + kScannedAtOnce);
         uint64_t walkEnd = limit;
-        const int count =
-            scanPages(_file(), PageScan::forPages(start, limit, kIsPresent | kIsSwapped), found, walkEnd);
+        PageScan first = PageScan::forPages(start, limit, kIsPresent | kIsSwapped);
+        first.mostPages = 1;  // or the kernel looks for the end of a range of gigabytes
+        const int count = scanPages(_file(), first, found, walkEnd);
         if (count != 0) {
             return count < 0 ? address : found[0].start;
         }

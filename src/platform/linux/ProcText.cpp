@@ -42,8 +42,9 @@ std::optional<ProcStat> parseStat(std::string_view text) {
     }
     stat.comm = text.substr(nameStart, close - nameStart);
     std::string_view rest = text.substr(close + 2);
+    rest = takeLine(rest);
     const std::string_view state = takeWord(rest);
-    if (state.empty() || !takeField(rest, stat.ppid)) {
+    if (state.empty() || !takeField(rest, stat.ppid) || stat.pid < 0 || stat.ppid < 0) {
         return std::nullopt;
     }
     stat.state = state.front();

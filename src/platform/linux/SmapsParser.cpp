@@ -1,5 +1,6 @@
 #include "platform/linux/SmapsParser.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <memory>
@@ -44,7 +45,8 @@ constexpr std::array<std::pair<std::string_view, VmFlag>, 12> kFlags = {{{"mr", 
                                                                          {"nr", VmFlagNoReserve},
                                                                          {"ss", VmFlagShadowStack}}};
 
-// A line of a mapping holds one path, of at most 4096 bytes of which each can be written as four.
+// A line of a mapping holds one path, of at most 4096 bytes of which each can be written as four. What goes
+// on behind that is passed over.
 constexpr size_t kLongestLine = size_t{5} * 4096;
 
 uint32_t parseFlags(std::string_view text) {
@@ -142,6 +144,7 @@ std::vector<Vma> SmapsParser::finish() {
 }
 
 void SmapsParser::_parseLine(std::string_view line) {
+    line = line.substr(0, kLongestLine);
     if (isMapping(line)) {
         _parseHeader(line);
     } else if (_inMapping) {
@@ -172,8 +175,11 @@ void SmapsParser::_parseField(std::string_view line) {
     for (size_t tried = 0; tried < kFields.size(); ++tried) {
         const size_t index = (_nextField + tried) % kFields.size();
         if (kFields[index].name == name) {
-            _vmas.back().*kFields[index].bytes = parseKilobytes(line.substr(colon + 1)).value_or(0);
-            _vmas.back().hasCounts = true;
+            Vma& vma = _vmas.back();
+            // Counts are added up later on: what a mapping cannot hold must not wrap.
+            vma.*kFields[index].bytes =
+                std::min(parseKilobytes(line.substr(colon + 1)).value_or(0), vma.size());
+            vma.hasCounts = true;
             _nextField = index + 1;
             return;
         }

@@ -59,12 +59,14 @@ struct Vma {
     uint64_t resident() const { return rss + sharedHugetlb + privateHugetlb; }
     uint64_t device() const { return (uint64_t{deviceMajor} << 32U) | deviceMinor; }
     bool has(VmFlag flag) const { return (flags & flag) != 0; }
+    bool operator==(const Vma&) const = default;
 };
 
 /// Turns the text of `smaps` or `maps` into mappings, piece by piece: the text of a process with 40,000
 /// mappings is 28 MB and is never held whole. Lines that cannot be read as what they should be are passed
 /// over, unknown fields are ignored, fields that an older kernel lacks stay 0, so any text at all gives a
-/// list of mappings whose end is above their start, in ascending order and without overlap.
+/// list of mappings whose end is above their start, in ascending order and without overlap, none of them with
+/// a count above its size.
 class SmapsParser {
 public:
     /// Uses the room of `vmas`, whatever they were.

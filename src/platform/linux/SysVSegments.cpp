@@ -40,7 +40,7 @@ bool readSegment(const std::vector<std::string_view>& words, const Columns& colu
     };
     return read(segment.identifier) && read(segment.size) && read(segment.creator) &&
            read(segment.attached) && read(segment.changeTime) && read(segment.resident) &&
-           read(segment.swapped);
+           read(segment.swapped) && segment.creator >= 0;
 }
 
 }  // namespace
