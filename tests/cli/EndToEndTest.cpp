@@ -183,6 +183,13 @@ protected:
     std::string _folder = testing::TempDir() + "memweight-XXXXXX";
 };
 
+TEST_F(SavedProcesses, AreOfTheVersionThatBothProgramsTell) {
+    const Report reader = memweight("no-such-process --version");
+    EXPECT_EQ(reader.status, 0);
+    EXPECT_EQ(reader.text, "memweight " MEMWEIGHT_VERSION "\n");
+    EXPECT_EQ(save("--version"), std::pair(0, std::string("memweight-heapsnap " MEMWEIGHT_VERSION "\n")));
+}
+
 TEST_F(SavedProcesses, AreReportedLikeTheLivingOnes) {
     const int memfd = memfd_create("end-to-end", 0);
     ASSERT_EQ(ftruncate(memfd, 64 * kPage), 0);
