@@ -19,19 +19,21 @@ quietly() {
     fi
 }
 
+# Those that the lists name and that are not installed.
 missing_packages() {
     local package
-    sed 's/#.*//' "$top/dependencies.txt" | while read -r package; do
+    cat "$@" | sed 's/#.*//' | while read -r package; do
         if [[ -n $package && $(dpkg-query -W -f='${db:Status-Status}' "$package" 2>/dev/null) != installed ]]; then
             echo "$package"
         fi
     done
 }
 
+# What dependencies.txt names, and further lists of the same form.
 install_dependencies() {
     local missing
     local -a packages as_root=()
-    missing=$(missing_packages)
+    missing=$(missing_packages "$top/dependencies.txt" "$@")
     [[ -n $missing ]] || return 0
     mapfile -t packages <<<"$missing"
     if ((EUID != 0)); then

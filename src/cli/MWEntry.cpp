@@ -12,6 +12,7 @@
 #include "analysis/MWMemweight.h"
 #include "cli/MWSampling.h"
 #include "cli/MWUsage.h"
+#include "cli/MWVersion.h"
 #include "output/MWOutputFormatterJSON.h"
 #include "output/MWOutputFormatterStatpack.h"
 #include "platform/MWHostInterface.h"
@@ -33,9 +34,14 @@ void printDescription(const std::optional<MWError>& error) {
 }
 
 int rejectArguments(const MWError& error) {
+    const auto isRequest = [&](int code) { return error.domain == MWMemweightError && error.code == code; };
+    if (isRequest(MWErrorVersion)) {
+        MWPrintVersion("memweight");
+        return kSuccess;
+    }
     printDescription(error);
     MWPrintUsage();
-    return error.domain == MWMemweightError && error.code == MWErrorHelp ? kSuccess : kFailure;
+    return isRequest(MWErrorHelp) ? kSuccess : kFailure;
 }
 
 bool needsRoot(const MWMemweightArgs& args) {

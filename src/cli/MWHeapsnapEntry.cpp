@@ -15,6 +15,7 @@
 #include <string_view>
 #include <system_error>
 
+#include "cli/MWVersion.h"
 #include "output/MWHeapsnapWriter.h"
 #include "output/MWOutputFile.h"
 #include "platform/MWHostInterface.h"
@@ -59,11 +60,11 @@ int usage(std::FILE* stream, int status) {
 /// None, and the exit status, when there is nothing to do.
 std::optional<Arguments> parse(int argc, char* const argv[], int& status) {
     constexpr int kObjectDirty = 256;
-    static const option kOptions[] = {{"output", required_argument, nullptr, 'o'},
-                                      {"force", no_argument, nullptr, 'f'},
-                                      {"vmObjectDirty", no_argument, nullptr, kObjectDirty},
-                                      {"help", no_argument, nullptr, 'h'},
-                                      {nullptr, 0, nullptr, 0}};
+    constexpr int kVersion = 257;
+    static const option kOptions[] = {
+        {"output", required_argument, nullptr, 'o'},           {"force", no_argument, nullptr, 'f'},
+        {"vmObjectDirty", no_argument, nullptr, kObjectDirty}, {"help", no_argument, nullptr, 'h'},
+        {"version", no_argument, nullptr, kVersion},           {nullptr, 0, nullptr, 0}};
     Arguments arguments;
     optind = 0;
     for (int option = 0; (option = getopt_long(argc, argv, "o:fh", kOptions, nullptr)) != -1;) {
@@ -79,6 +80,10 @@ std::optional<Arguments> parse(int argc, char* const argv[], int& status) {
                 break;
             case 'h':
                 status = usage(stdout, kSuccess);
+                return std::nullopt;
+            case kVersion:
+                MWPrintVersion("memweight-heapsnap");
+                status = kSuccess;
                 return std::nullopt;
             default:
                 status = usage(stderr, kFailure);

@@ -28,11 +28,12 @@ enum LongOnlyOption : int {
     OptionWired,
     OptionUnmapped,
     OptionSample,
+    OptionVersion,
 };
 
 constexpr const char* kShortOptions = "aj:htp:x:svf:yw";
 
-constexpr std::array<option, 20> kLongOptions = {{
+constexpr std::array<option, 21> kLongOptions = {{
     {"all", no_argument, nullptr, 'a'},
     {"json", required_argument, nullptr, 'j'},
     {"statpack", required_argument, nullptr, OptionStatpack},
@@ -52,6 +53,7 @@ constexpr std::array<option, 20> kLongOptions = {{
     {"wired", no_argument, nullptr, OptionWired},
     {"unmapped", no_argument, nullptr, OptionUnmapped},
     {"sample", required_argument, nullptr, OptionSample},
+    {"version", no_argument, nullptr, OptionVersion},
     {nullptr, 0, nullptr, 0},
 }};
 
@@ -104,6 +106,8 @@ MWMemweightArgs::Outcome MWMemweightArgs::_applyOption(int option, const char* a
             return {};
         case 'h':
             return failure(MWErrorHelp);
+        case OptionVersion:
+            return failure(MWErrorVersion);
         case 't':
             _targetChildren = true;
             return {};

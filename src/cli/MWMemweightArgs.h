@@ -23,6 +23,8 @@ enum MWMemweightErrorCode : int {
     MWErrorUnreadableFile = 7,
     MWErrorNoTarget = 8,
     MWErrorSample = 9,
+    /// `--version`: nothing failed, but there is nothing to measure, as with help.
+    MWErrorVersion = 10,
 };
 
 /// What target resolution found. No map when it failed; a map with an error beside it when some names

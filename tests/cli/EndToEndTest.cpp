@@ -184,6 +184,13 @@ protected:
     std::string _folder = testing::TempDir() + "memweight-XXXXXX";
 };
 
+TEST_F(SavedProcesses, AreOfTheVersionThatBothProgramsTell) {
+    const Report reader = memweight("no-such-process --version");
+    EXPECT_EQ(reader.status, 0);
+    EXPECT_EQ(reader.text, "memweight " MEMWEIGHT_VERSION "\n");
+    EXPECT_EQ(save("--version"), std::pair(0, std::string("memweight-heapsnap " MEMWEIGHT_VERSION "\n")));
+}
+
 TEST_F(SavedProcesses, AreReportedLikeTheLivingOnes) {
     // Pages of a program that has just been linked are dirty until they are written, be it between the two
     // looks.

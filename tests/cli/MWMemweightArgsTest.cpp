@@ -90,6 +90,8 @@ TEST(MWMemweightArgs, RefusesWithCodeAndDescription) {
     EXPECT_EQ(refusal({"--nonsense"}), "5");
     EXPECT_EQ(refusal({"bash", "-j"}), "5");
     EXPECT_EQ(refusal({"--s"}), "5");  // an abbreviation of several options
+    EXPECT_EQ(refusal({"--v"}), "5");
+    EXPECT_EQ(refusal({"bash", "--vers", "--sort", "nonsense"}), "10");
     EXPECT_EQ(refusal({"--pid", "abc", "-h"}).substr(0, 1), "4");
     EXPECT_EQ(refusal({"-aha"}), "1");
     EXPECT_FALSE(parsed({"bash"}).targetAll()) << "the scan starts afresh after one that ended in a group";
