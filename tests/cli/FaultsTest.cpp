@@ -394,9 +394,9 @@ protected:
         return pids;
     }
 
-    /// Files without which a process cannot be measured.
+    /// Files without which a process cannot be measured; `maps` is not read of one as small as these.
     static bool isNeeded(const std::filesystem::path& name) {
-        static const std::set<std::string> kNeeded = {"stat", "maps", "smaps", "pagemap"};
+        static const std::set<std::string> kNeeded = {"stat", "smaps", "pagemap"};
         const bool isOfProcess = std::distance(name.begin(), name.end()) == 3;
         return isOfProcess && kNeeded.contains(name.filename());
     }

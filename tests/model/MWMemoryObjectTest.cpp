@@ -145,7 +145,7 @@ TEST_F(MWMemoryObjectTest, ChargesDirtyPagesToTheOwnerAlone) {
     const auto ofTwo = unmapped->viewForProcess(two);
     EXPECT_EQ(sizes(*ofTwo), (MWCategoryTotals{.clean = 6 * P, .wired = 8 * P}));
     EXPECT_EQ(sizes(*unmapped), whole);
-    EXPECT_EQ(&ofTwo->memoryRegions(), &unmapped->memoryRegions());
+    EXPECT_EQ(ofTwo->memoryRegions(), unmapped->memoryRegions());
     EXPECT_EQ(ofTwo->ownerPid(), 1);
 
     // With views of their own: the owner's dirty pages become clean on top of what the other one sees.
