@@ -6,6 +6,7 @@
 
 #include "platform/MWHostInterface.h"
 #include "platform/MWPhysMemweightSwitch.h"
+#include "process/MWUnresponsiveProcess.h"
 
 MWMemweight::MWMemweight(MWProcessList processes) : _processes(std::move(processes)) {}
 
@@ -36,34 +37,45 @@ MWProcessList MWMemweight::_longestFirst(MWProcessList processes) {
 }
 
 bool MWMemweight::gatherData() {
-    const MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
-    const MWProcessList ordered = _processesBySortingPidDesc(_processes);
-    const MWProcessList scheduled = _longestFirst(ordered);
     _gatherStartTime = MWTime::now();
-    _prepareToGather(queue, ordered);
-    std::atomic<bool> stoppedEarly = false;
-    queue.apply(ordered.size(), [&](size_t index) {
-        if (_earlyExit) {
-            stoppedEarly = true;
-        } else {
-            scheduled[index]->gatherData();
-        }
-    });
-    if (stoppedEarly) {
-        ordered.back()->_addGlobalError(
-            "Memweight exited early due to SIGINT and did not finish gathering all data");
+    MWHostInterface::current().beginOwnedVmObjectSurvey();
+    MWProcessList processes = _processesBySortingPidDesc(_processes);
+    processes = _takeStep(processes, [](MWProcess& process) { process.prepareToGatherData(); });
+    // Those of an earlier measurement, which may still be printed, have what they need.
+    std::erase_if(processes, [](const auto& process) { return process->memoryRegions().has_value(); });
+    processes =
+        _takeStep(_longestFirst(std::move(processes)), [](MWProcess& process) { process.gatherData(); });
+    if (_gathering->stoppedEarly && !processes.empty()) {
+        _processesBySortingPidDesc(std::move(processes))
+            .back()
+            ->_addGlobalError("Memweight exited early due to SIGINT and did not finish gathering all data");
     }
     _gatherEndTime = MWTime::now();
-    return stoppedEarly;
+    return _gathering->stoppedEarly;
 }
 
-void MWMemweight::_prepareToGather(const MWConcurrentQueue& queue, const MWProcessList& processes) const {
-    MWHostInterface::current().beginOwnedVmObjectSurvey();
-    queue.apply(processes.size(), [&](size_t index) {
-        if (!_earlyExit) {
-            processes[index]->prepareToGatherData();
+/// Answers those that took it. One that does not get any further is reported as an error: in its place comes
+/// another process object, because nobody but the thread that was given up may touch it any more.
+MWProcessList MWMemweight::_takeStep(const MWProcessList& processes, const GatheringStep& step) {
+    const MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
+    const auto stuck = queue.apply(processes.size(), [processes, step, gathering = _gathering](size_t index) {
+        if (gathering->earlyExit) {
+            gathering->stoppedEarly = true;
+        } else {
+            step(*processes[index]);
         }
     });
+    MWProcessList remaining;
+    for (size_t index = 0; index < processes.size(); ++index) {
+        if (!std::ranges::binary_search(stuck, index)) {
+            remaining.push_back(processes[index]);
+            continue;
+        }
+        std::ranges::replace(
+            _processes, processes[index],
+            std::shared_ptr<MWProcess>(std::make_shared<MWUnresponsiveProcess>(*processes[index])));
+    }
+    return remaining;
 }
 
 void MWMemweight::analyzeData() {

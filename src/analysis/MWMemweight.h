@@ -70,7 +70,7 @@ public:
     bool gatherData();
     /// Processes that are not being gathered yet will not be. Safe from any thread, at any time, any number
     /// of times.
-    void cancel() { _earlyExit = true; }
+    void cancel() { _gathering->earlyExit = true; }
     void analyzeData();
     /// Not owned; must outlive this object.
     void addOutputFormatter(MWOutputFormatter& formatter) { _outputFormatters.push_back(&formatter); }
@@ -109,8 +109,15 @@ public:
     static void _totalForCategories(const MWCategoryTable& categories, MWCategoryTotals& outTotal);
 
 private:
+    /// What the gathering threads share, be it for longer than there is a measurement.
+    struct Gathering {
+        std::atomic<bool> earlyExit = false;
+        std::atomic<bool> stoppedEarly = false;  ///< a process was left out for it
+    };
+    using GatheringStep = std::function<void(MWProcess&)>;
+
     static MWProcessList _longestFirst(MWProcessList processes);
-    void _prepareToGather(const MWConcurrentQueue& queue, const MWProcessList& processes) const;
+    MWProcessList _takeStep(const MWProcessList& processes, const GatheringStep& step);
 
     struct Messages {
         MWProcessOrder processesWithWarnings;
@@ -136,7 +143,7 @@ private:
     MWProcessToProcessGroups _groupsOf;
     size_t _objectCount = 0;  ///< of the analysis, also when the maps are gone
     std::vector<MWOutputFormatter*> _outputFormatters;
-    std::atomic<bool> _earlyExit = false;
+    std::shared_ptr<Gathering> _gathering = std::make_shared<Gathering>();
     uint32_t _qualityOfService = QOS_CLASS_UTILITY;
     std::optional<MWTime> _gatherStartTime;
     std::optional<MWTime> _gatherEndTime;

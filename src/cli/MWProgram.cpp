@@ -5,6 +5,9 @@
 #include <unistd.h>
 
 #include <csignal>
+#include <cstdio>
+
+#include "platform/MWWorkQueue.h"
 
 namespace {
 
@@ -31,4 +34,14 @@ void MWPrepareProgram() {
     close(descriptor);
     // A reader that has seen enough of the report must not cut the output files off.
     std::signal(SIGPIPE, SIG_IGN);
+    // A file that may not grow any more is told like a full disk.
+    std::signal(SIGXFSZ, SIG_IGN);
+}
+
+int MWEndProgram(int status) {
+    if (MWConcurrentQueue::hasGivenUp()) {
+        std::fflush(nullptr);
+        _exit(status);
+    }
+    return status;
 }

@@ -8,5 +8,5 @@ int main(int argc, char* argv[]) {
     static auto& host = *new MWLinuxHost;
     static auto& kept = *new MWKeptUntilExit;
     MWHostInterface::setCurrent(&host);
-    return MWMemweightMain(argc, argv, &kept);
+    return MWEndProgram(MWMemweightMain(argc, argv, &kept));
 }

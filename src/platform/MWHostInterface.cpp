@@ -1,5 +1,6 @@
 #include "platform/MWHostInterface.h"
 
+#include <chrono>
 #include <utility>
 
 #include "platform/MWInvariant.h"
@@ -16,6 +17,11 @@ MWHostInterface& MWHostInterface::current() {
 
 MWHostInterface* MWHostInterface::setCurrent(MWHostInterface* host) {
     return std::exchange(gCurrentHost, host);
+}
+
+void MWHostInterface::waitForChange(std::unique_lock<std::mutex>& lock, std::condition_variable& changed,
+                                    uint64_t nanoseconds) {
+    changed.wait_for(lock, std::chrono::nanoseconds(nanoseconds));
 }
 
 const MWLedgerTable& MWHostInterface::ledgerTable() {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <condition_variable>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -127,8 +128,8 @@ public:
     /// The largest argument area of any process, in bytes; 0 on success. (System control {1, 8}.)
     virtual int sysctlArgumentMaximum(uint64_t& bytes) = 0;
     /// A process's argument area (system control {1, 49, pid}): a 32-bit argument count, the path of the
-    /// executable, then the arguments, each NUL-terminated. `length` is the number of bytes written; 0 on
-    /// success.
+    /// executable, then the arguments that the host tells, each NUL-terminated. `length` is the number of
+    /// bytes written; 0 on success.
     virtual int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) = 0;
 
     // Ledgers.
@@ -184,6 +185,9 @@ public:
     virtual mach_timebase_info_t mach_timebase_info() = 0;
     /// The monotonic clock that stops while the system sleeps, in nanoseconds; timers go by it.
     virtual uint64_t uptimeNanoseconds() = 0;
+    /// Gives `lock` up and takes it again when `changed` is notified, or after so much time of that clock.
+    virtual void waitForChange(std::unique_lock<std::mutex>& lock, std::condition_variable& changed,
+                               uint64_t nanoseconds);
     /// A timer that is not armed; `handler` is given the number of fires and runs on `queue`, which outlives
     /// the timer. None with errno where the system has no more timers.
     virtual std::unique_ptr<MWTimer> makeTimer(MWSerialQueue& queue,

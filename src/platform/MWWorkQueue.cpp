@@ -5,15 +5,13 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include <algorithm>
-#include <atomic>
+#include <memory>
 #include <semaphore>
-#include <system_error>
 #include <thread>
 #include <utility>
-#include <vector>
 
 #include "platform/MWSignalMask.h"
+#include "platform/MWWatchedWork.h"
 
 namespace {
 
@@ -39,28 +37,20 @@ void nameThread(const std::string& label) {
 MWConcurrentQueue::MWConcurrentQueue(std::string label, uint32_t qualityOfService)
     : _label(std::move(label)), _qualityOfService(qualityOfService) {}
 
-void MWConcurrentQueue::apply(size_t count, const std::function<void(size_t)>& work) const {
-    std::atomic<size_t> next = 0;
-    const auto drain = [&] {
-        nameThread(_label);
-        applyQualityOfService(_qualityOfService);
-        for (size_t index = next++; index < count; index = next++) {
-            work(index);
-        }
+std::vector<size_t> MWConcurrentQueue::apply(size_t count, std::function<void(size_t)> work) const {
+    const auto setUpThread = [label = _label, qualityOfService = _qualityOfService] {
+        nameThread(label);
+        applyQualityOfService(qualityOfService);
     };
-    const size_t width = std::min<size_t>(count, std::max(1U, std::thread::hardware_concurrency()));
-    std::vector<std::jthread> threads;
-    threads.reserve(width);
-    try {
-        while (threads.size() < width) {
-            threads.emplace_back(drain);
-        }
-    } catch (const std::system_error&) {
-        // No more threads to be had: those that there are do the work, in the last resort this one.
-        if (threads.empty()) {
-            drain();
-        }
-    }
+    return std::make_shared<MWWatchedWork>(count, std::move(work))->run(setUpThread);
+}
+
+bool MWConcurrentQueue::hasGivenUp() {
+    return MWWatchedWork::hasGivenUp();
+}
+
+void MWConcurrentQueue::awaitGivenUp() {
+    MWWatchedWork::awaitGivenUp();
 }
 
 MWSerialQueue::MWSerialQueue(std::string label, uint32_t qualityOfService) : _label(std::move(label)) {

@@ -8,6 +8,7 @@
 #include <mutex>
 #include <string>
 #include <thread>
+#include <vector>
 
 /// Scheduling classes for work: the values are fixed by the design, the effect is a nice value of the
 /// queue's threads (interactive work is not slowed by a measurement in the background).
@@ -15,12 +16,25 @@ inline constexpr uint32_t QOS_CLASS_UTILITY = 17;
 inline constexpr uint32_t QOS_CLASS_USER_INITIATED = 25;
 
 /// A concurrent queue: work items start in index order on as many threads as there are processors.
+///
+/// The system can take for ever to answer, for example about a process whose memory map is locked. An item
+/// that marks no step (see MWProgress) for `patience` is given up, and another thread does the rest.
 class MWConcurrentQueue {
 public:
+    /// Nanoseconds of the host's uptime clock.
+    static constexpr uint64_t patience = 10'000'000'000;
+
     MWConcurrentQueue(std::string label, uint32_t qualityOfService);
 
-    /// Runs work(0) ... work(count - 1) and returns when all of them have ended.
-    void apply(size_t count, const std::function<void(size_t)>& work) const;
+    /// Runs work(0) ... work(count - 1). Returns when each has ended or was given up, with the indices of the
+    /// latter, ascending. An item that was given up goes on should it get its answer after all: whatever
+    /// `work` touches has to be owned by it, and the caller must not look at what such an item makes.
+    std::vector<size_t> apply(size_t count, std::function<void(size_t)> work) const;
+
+    /// Whether there are items given up that go on.
+    static bool hasGivenUp();
+    /// Returns when every item that was given up has ended after all.
+    static void awaitGivenUp();
 
     const std::string& label() const { return _label; }
 

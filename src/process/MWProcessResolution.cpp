@@ -14,11 +14,13 @@
 #include "platform/MWWorkQueue.h"
 #include "process/MWKernelProcess.h"
 #include "process/MWProcess.h"
+#include "process/MWUnresponsiveProcess.h"
 #include "process/MWUserProcess.h"
 
 namespace {
 
 using ProcessSnapshot = std::vector<proc_bsdinfo>;
+using Record = std::optional<proc_bsdinfo>;
 
 /// Processes that may start between asking for their number and asking for them.
 constexpr size_t kRoomForNewPids = 20;
@@ -38,7 +40,7 @@ std::optional<std::vector<int32_t>> listAllPids() {
     return pids;
 }
 
-std::optional<proc_bsdinfo> recordOfPid(int32_t pid) {
+Record recordOfPid(int32_t pid) {
     proc_bsdinfo info = {};
     if (MWHostInterface::current().proc_pidinfo(pid, info) != static_cast<int>(sizeof(info))) {
         return std::nullopt;
@@ -46,34 +48,56 @@ std::optional<proc_bsdinfo> recordOfPid(int32_t pid) {
     return info;
 }
 
-/// Calls `work` with 0 ... count - 1, on all processors where there is enough to do.
-void forEachIndex(size_t count, const std::function<void(size_t)>& work) {
+/// What `make` makes of each of 0 ... count - 1, on all processors where there is enough to do; where the
+/// system does not answer, what `instead` makes.
+template <class Result>
+std::vector<Result> makeEach(size_t count, const std::function<Result(size_t)>& make,
+                             const std::function<Result(size_t)>& instead) {
     constexpr size_t kWorthThreads = 64;
-    if (count >= kWorthThreads) {
-        MWConcurrentQueue("org.memweight.memweight.processes", QOS_CLASS_UTILITY).apply(count, work);
-        return;
+    const auto results = std::make_shared<std::vector<Result>>(count);
+    if (count < kWorthThreads) {
+        for (size_t index = 0; index < count; ++index) {
+            (*results)[index] = make(index);
+        }
+        return std::move(*results);
     }
+    const MWConcurrentQueue queue("org.memweight.memweight.processes", QOS_CLASS_UTILITY);
+    const auto stuck = queue.apply(count, [results, make](size_t index) { (*results)[index] = make(index); });
+    if (stuck.empty()) {
+        return std::move(*results);
+    }
+    std::vector<Result> answered(count);
     for (size_t index = 0; index < count; ++index) {
-        work(index);
+        const bool isStuck = std::ranges::binary_search(stuck, index);
+        answered[index] = isStuck ? instead(index) : std::move((*results)[index]);
     }
+    return answered;
 }
 
-/// Every process there is now, in the order of the system's list; none when there is no telling.
-std::optional<ProcessSnapshot> takeSnapshot() {
+/// All that is known of a process about which the system does not answer.
+Record recordOfPidAlone(int32_t pid) {
+    proc_bsdinfo info = {};
+    info.pbi_pid = static_cast<uint32_t>(pid);
+    return info;
+}
+
+/// Every process there is now, in the order of the system's list; null when there is no telling.
+std::shared_ptr<const ProcessSnapshot> takeSnapshot() {
     const auto pids = listAllPids();
     if (!pids) {
-        return std::nullopt;
+        return nullptr;
     }
-    std::vector<std::optional<proc_bsdinfo>> records(pids->size());
-    forEachIndex(pids->size(), [&](size_t index) { records[index] = recordOfPid((*pids)[index]); });
-    ProcessSnapshot snapshot;
-    snapshot.reserve(pids->size());
-    for (const auto& record : records) {
+    const auto records = makeEach<Record>(
+        pids->size(), [pids = *pids](size_t index) { return recordOfPid(pids[index]); },
+        [&](size_t index) { return recordOfPidAlone((*pids)[index]); });
+    auto snapshot = std::make_shared<ProcessSnapshot>();
+    snapshot->reserve(pids->size());
+    for (const Record& record : records) {
         if (record) {
-            snapshot.push_back(*record);
+            snapshot->push_back(*record);
         }
     }
-    return snapshot.empty() ? std::nullopt : std::optional(std::move(snapshot));
+    return snapshot->empty() ? nullptr : std::move(snapshot);
 }
 
 int32_t pidOf(const proc_bsdinfo& info) {
@@ -148,11 +172,12 @@ std::optional<int64_t> leadingInteger(std::string_view text) {
 /// read once for the snapshot's life.
 class DescriptionMatcher {
 public:
-    explicit DescriptionMatcher(const ProcessSnapshot& snapshot)
-        : _snapshot(snapshot), _names(snapshot.size()) {
-        forEachIndex(_names.size(),
-                     [&](size_t index) { _names[index] = MWProcess::_nameForBsdInfo(_snapshot[index]); });
-    }
+    explicit DescriptionMatcher(const std::shared_ptr<const ProcessSnapshot>& snapshot)
+        : _snapshot(*snapshot),
+          _names(makeEach<std::string>(
+              snapshot->size(),
+              [snapshot](size_t index) { return MWProcess::_nameForBsdInfo((*snapshot)[index]); },
+              [&](size_t index) { return MWProcess::_nameForBsdInfoCommName(_snapshot[index]); })) {}
 
     /// Adds what `description` selects to `pids`; false when that is nothing.
     bool match(const std::string& description, MWPidMap& pids) {
@@ -234,15 +259,15 @@ std::optional<MWTargetMap> MWProcess::allProcessesExcludingPids(const std::set<i
     if (!snapshot) {
         return std::nullopt;
     }
-    std::vector<std::shared_ptr<MWProcess>> made(snapshot->size());
-    forEachIndex(snapshot->size(), [&](size_t index) {
+    const auto make = [snapshot, excludedPids](size_t index) {
         const proc_bsdinfo& info = (*snapshot)[index];
-        if (!excludedPids.contains(pidOf(info))) {
-            made[index] = processWithBsdInfo(info);
-        }
-    });
+        return excludedPids.contains(pidOf(info)) ? nullptr : processWithBsdInfo(info);
+    };
+    const auto unresponsive = [&](size_t index) {
+        return std::make_shared<MWUnresponsiveProcess>((*snapshot)[index]);
+    };
     MWTargetMap processes;
-    for (auto& process : made) {
+    for (auto& process : makeEach<std::shared_ptr<MWProcess>>(snapshot->size(), make, unresponsive)) {
         if (process != nullptr) {
             processes[process->asNumber()] = std::move(process);
         }
@@ -262,7 +287,7 @@ std::optional<MWPidMap> MWProcess::pidsForStringDescriptions(const std::vector<s
         addError("Unable to obtain system process list");
         return std::nullopt;
     }
-    DescriptionMatcher matcher(*snapshot);
+    DescriptionMatcher matcher(snapshot);
     MWPidMap pids;
     for (const std::string& description : descriptions) {
         if (!matcher.match(description, pids)) {

@@ -155,6 +155,7 @@ protected:
         setUpSystem(inner);
         FaultyHost host(inner, fault);
         Outcome outcome = runProgram(arguments, _top + "/report.json");
+        host.release();
         if (!inner.unlinked.empty()) {
             outcome.document = Json();
         }
@@ -266,6 +267,31 @@ TEST_F(Faults, EveryQuestionInItsTurn) {
             }
         }
     }
+}
+
+// The system may never answer, about one process: that one is an error, and the others are what they are.
+TEST_F(Faults, AProcessThatDoesNotRespond) {
+    const Outcome sound = run({"-a"});
+    std::set<std::string> operations;
+    for (const auto& [question, form] : sound.questions) {
+        if (!form.isWatched || question.turn != 1) {
+            continue;
+        }
+        SCOPED_TRACE(question.operation + " " + std::to_string(question.pid));
+        operations.insert(question.operation);
+        const Outcome outcome = run({"-a"}, HostFault{question, FaultKind::hangs});
+        EXPECT_EQ(outcome.status, 0);
+        EXPECT_EQ(outcome.openTasks, 0U);
+        auto spared = sound.pids();
+        spared.erase(question.pid);
+        expectUnharmed(spared, outcome, sound);
+        const Json stuck = outcome.processes().at(question.pid);
+        const std::string text = sound.processes().at(question.pid)["name"].get<std::string>() + " [" +
+                                 std::to_string(question.pid) + "]: not responding";
+        EXPECT_EQ(stuck["errors"], Json({text}));
+        EXPECT_NE(outcome.report.find(text), std::string::npos) << outcome.report;
+    }
+    EXPECT_GE(operations.size(), 8U) << "the questions of a whole gathering";
 }
 
 /// A procfs of three processes, each of a text, a heap that it shares with its family in part, shared memory

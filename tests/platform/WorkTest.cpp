@@ -7,12 +7,16 @@
 #include <cerrno>
 #include <csignal>
 #include <memory>
+#include <mutex>
+#include <numeric>
 #include <semaphore>
+#include <thread>
 #include <vector>
 
 #include "platform/MWInterruptSource.h"
 #include "platform/MWInvariant.h"
 #include "platform/MWPhysMemweightSwitch.h"
+#include "platform/MWProgress.h"
 #include "platform/MWWorkQueue.h"
 #include "platform/linux/LinuxTimer.h"
 #include "support/FakeHost.h"
@@ -20,11 +24,88 @@
 namespace {
 
 TEST(WorkQueue, RunsEachItemOnceAndWaitsForAll) {
+    const FakeHost host;
     const MWConcurrentQueue queue("test.queue", QOS_CLASS_USER_INITIATED);
     std::vector<std::atomic<int>> runs(500);
     queue.apply(runs.size(), [&](size_t index) { ++runs[index]; });
     EXPECT_TRUE(std::all_of(runs.begin(), runs.end(), [](int count) { return count == 1; }));
     queue.apply(0, [](size_t) { FAIL() << "there is no work"; });
+}
+
+/// Its time passes while somebody waits and `passes` is set.
+class QuickHost : public FakeHost {
+public:
+    std::atomic<bool> passes = false;
+
+    void waitForChange(std::unique_lock<std::mutex>& lock, std::condition_variable& changed,
+                       uint64_t nanoseconds) override {
+        FakeHost::waitForChange(lock, changed, passes ? nanoseconds / 1000 : nanoseconds);
+        uptime += passes ? nanoseconds : 0;
+    }
+};
+
+TEST(WorkQueue, GivesUpWhatMakesNoProgress) {
+    constexpr size_t kItems = 40;
+    struct Shared {
+        std::atomic<size_t> ended = 0;
+        std::atomic<bool> released = false;
+        std::atomic<int> steps = 0;
+    };
+    QuickHost host;
+    const auto shared = std::make_shared<Shared>();
+    const MWConcurrentQueue queue("test.queue", QOS_CLASS_USER_INITIATED);
+    // More of them than there are threads, and one that takes long but goes on.
+    const size_t stuck = std::thread::hardware_concurrency() + 1;
+    const auto givenUp = queue.apply(kItems, [&host, shared, stuck](size_t index) {
+        if (index < stuck) {
+            host.passes = true;
+            shared->released.wait(false);
+        } else if (index == stuck) {
+            const uint64_t begin = host.uptime;
+            while (host.uptime < begin + 3 * MWConcurrentQueue::patience) {
+                MWProgress::mark();
+                ++shared->steps;
+                std::this_thread::yield();
+            }
+        }
+        ++shared->ended;
+    });
+    std::vector<size_t> expected(stuck);
+    std::iota(expected.begin(), expected.end(), 0);
+    EXPECT_EQ(givenUp, expected);
+    EXPECT_EQ(shared->ended, kItems - stuck);
+    EXPECT_GT(shared->steps, 0);
+    EXPECT_TRUE(MWConcurrentQueue::hasGivenUp());
+    shared->released = true;
+    shared->released.notify_all();
+    MWConcurrentQueue::awaitGivenUp();
+    EXPECT_EQ(shared->ended, kItems) << "they end after all";
+    EXPECT_FALSE(MWConcurrentQueue::hasGivenUp());
+}
+
+// A stopped program finds much time gone when it goes on.
+TEST(WorkQueue, DoesNotTakeItsOwnStopForAnothers) {
+    class StoppedHost : public FakeHost {
+    public:
+        std::binary_semaphore goOn = std::binary_semaphore(0);
+        int waits = 0;
+
+        void waitForChange(std::unique_lock<std::mutex>& lock, std::condition_variable& changed,
+                           uint64_t nanoseconds) override {
+            constexpr int kLooks = 3;
+            if (++waits <= kLooks) {
+                uptime += 3 * MWConcurrentQueue::patience;
+                return;
+            }
+            if (waits == kLooks + 1) {
+                goOn.release();
+            }
+            FakeHost::waitForChange(lock, changed, nanoseconds);
+        }
+    };
+    StoppedHost host;
+    const MWConcurrentQueue queue("test.queue", QOS_CLASS_USER_INITIATED);
+    EXPECT_TRUE(queue.apply(1, [&host](size_t) { host.goOn.acquire(); }).empty());
 }
 
 TEST(SerialQueue, RunsItemsInOrderAndAllOfThem) {

@@ -4,6 +4,7 @@
 
 #include "process/MWProcess.h"
 #include "support/FakeHost.h"
+#include "support/FaultyHost.h"
 
 namespace {
 
@@ -119,6 +120,31 @@ TEST(MWProcessResolutionTest, UnreadableProcessListIsNoEmptyList) {
     host.processes[5] = {};
     host.processListFails = true;
     allFail();
+}
+
+TEST(MWProcessResolutionTest, AProcessThatDoesNotRespondIsAnError) {
+    constexpr int32_t kStuck = 30;
+    FakeHost inner;
+    for (int32_t pid = 1; pid <= 80; ++pid) {
+        inner.processes[pid] = {.comm = "worker"};
+    }
+    const std::vector<std::pair<std::string, std::string>> cases = {
+        {"proc_pidinfo", "Unknown [30]: not responding"},  // and again when its task is asked for
+        {"task_read_for_pid", "worker [30]: not responding"},
+        {"sysctlArgumentArea", "worker [30]: not responding"},
+    };
+    for (const auto& [operation, message] : cases) {
+        SCOPED_TRACE(operation);
+        FaultyHost host(inner, HostFault{{operation, kStuck, 1}, FaultKind::hangs});
+        const auto processes = MWProcess::allProcessesExcludingPids({});
+        host.release();
+        ASSERT_TRUE(processes);
+        EXPECT_EQ(processes->size(), 80U);
+        for (const auto& [pid, process] : *processes) {
+            const bool isStuck = pid == kStuck && operation != "proc_pidinfo";
+            EXPECT_EQ(process->errors(), isStuck ? Lines{message} : Lines{});
+        }
+    }
 }
 
 }  // namespace

@@ -2,11 +2,16 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
+
+#include "platform/MWProgress.h"
+#include "platform/MWWorkQueue.h"
 
 FaultyHost::FaultyHost(MWHostInterface& inner, std::optional<HostFault> fault)
     : _inner(inner), _previous(MWHostInterface::setCurrent(this)), _fault(std::move(fault)) {}
 
 FaultyHost::~FaultyHost() {
+    release();
     MWHostInterface::setCurrent(_previous);
 }
 
@@ -15,11 +20,39 @@ int32_t FaultyHost::_pidOf(task_t task) {
     return _pids.at(task);
 }
 
+void FaultyHost::release() {
+    _hangs = false;
+    _hangs.notify_all();
+    MWConcurrentQueue::awaitGivenUp();
+}
+
+void FaultyHost::_hang() {
+    _hangs = true;
+    _hangs.wait(true);
+}
+
+void FaultyHost::waitForChange(std::unique_lock<std::mutex>& lock, std::condition_variable& changed,
+                               uint64_t nanoseconds) {
+    constexpr std::chrono::microseconds kTurnOfTheOthers(200);
+    if (_hangs) {
+        changed.wait_for(lock, kTurnOfTheOthers);
+        _uptime += nanoseconds;
+    } else {
+        _inner.waitForChange(lock, changed, nanoseconds);
+    }
+}
+
 std::optional<FaultKind> FaultyHost::_note(const std::string& operation, int32_t pid, Form form) {
-    const std::lock_guard lock(_mutex);
+    form.isWatched = MWProgress::isWatched();
+    std::unique_lock lock(_mutex);
     const HostQuestion question = {operation, pid, ++_turns[{operation, pid}]};
     _questions.emplace(question, form);
     if (!_fault) {
+        return std::nullopt;
+    }
+    if (question == _fault->question && _fault->kind == FaultKind::hangs) {
+        lock.unlock();
+        _hang();
         return std::nullopt;
     }
     if (question == _fault->question) {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <atomic>
+#include <condition_variable>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -27,6 +29,7 @@ enum class FaultKind : uint8_t {
     isHalf,  ///< of the bytes, records or words
     isEmpty,
     processEnds,  ///< before it: this question and all later ones find the process gone
+    hangs,        ///< until the host is released
 };
 
 struct HostFault {
@@ -44,6 +47,7 @@ public:
         bool hasKernelCode = false;
         bool hasErrno = false;
         bool hasAmount = false;
+        bool isWatched = false;  ///< asked by work that can be given up
     };
 
     explicit FaultyHost(MWHostInterface& inner, std::optional<HostFault> fault = {});
@@ -52,6 +56,8 @@ public:
     FaultyHost& operator=(const FaultyHost&) = delete;
 
     const std::map<HostQuestion, Form>& questions() const { return _questions; }
+    /// Answers the question that hangs, if one does, and waits for what was given up for it.
+    void release();
 
     kern_return_t task_read_for_pid(int32_t pid, task_t& task) override;
     void task_release(task_t task) override { _inner.task_release(task); }
@@ -96,7 +102,10 @@ public:
     void forEachImage(task_t task, const std::function<void(const MWImageDescription&)>& block) override;
     int mach_get_times(MWClockReading& reading) override;
     mach_timebase_info_t mach_timebase_info() override { return _inner.mach_timebase_info(); }
-    uint64_t uptimeNanoseconds() override { return _inner.uptimeNanoseconds(); }
+    /// A clock of its own: it runs, at a great pace, while a question hangs.
+    uint64_t uptimeNanoseconds() override { return _uptime; }
+    void waitForChange(std::unique_lock<std::mutex>& lock, std::condition_variable& changed,
+                       uint64_t nanoseconds) override;
     std::unique_ptr<MWTimer> makeTimer(MWSerialQueue& queue, std::function<void(uint64_t)> handler) override {
         return _inner.makeTimer(queue, std::move(handler));
     }
@@ -108,6 +117,7 @@ public:
 
 private:
     int32_t _pidOf(task_t task);
+    void _hang();
     /// Notes the question; the kind of fault that its answer has, if it has one.
     std::optional<FaultKind> _note(const std::string& operation, int32_t pid, Form form);
     template <class Amount>
@@ -130,4 +140,6 @@ private:
     std::map<std::pair<std::string, int32_t>, int> _turns;
     std::map<task_t, int32_t> _pids;
     bool _isProcessGone = false;  ///< that of the fault
+    std::atomic<bool> _hangs = false;
+    std::atomic<uint64_t> _uptime = 0;
 };

@@ -4,7 +4,7 @@
 
 int main(int argc, char* argv[]) {
     MWPrepareProgram();
-    MWLinuxHost host("/proc", "/sys", MappingSource::smaps);
+    static auto& host = *new MWLinuxHost("/proc", "/sys", MappingSource::smaps);
     MWHostInterface::setCurrent(&host);
-    return MWHeapsnapMain(argc, argv);
+    return MWEndProgram(MWHeapsnapMain(argc, argv));
 }

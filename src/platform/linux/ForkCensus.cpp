@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 
-#include "platform/linux/ForkFamily.h"
 #include "platform/linux/LinuxTask.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
@@ -10,35 +9,34 @@
 namespace {
 
 // Of a process whose first thread has ended, those of one that lives. Kernel threads have none.
-std::optional<uint64_t> identifierOf(int processDirectory, int32_t pid, const ObjectIdentity& identity) {
+std::string auxiliaryVectorOf(int processDirectory) {
     std::string text;
     if (procfs::readRecord(processDirectory, "auxv", text) && !text.empty()) {
-        return randomBytesIdentifier(text, pid, identity);
+        return text;
     }
     const auto stat =
         procfs::readRecord(processDirectory, "stat", text) ? procfs::parseStat(text) : std::nullopt;
     if (!stat || !stat->threadEnded()) {
-        return std::nullopt;
+        return {};
     }
-    const LiveThread thread = openLiveThread(processDirectory);
-    procfs::readRecord(thread.directory.get(), "auxv", text);
-    return randomBytesIdentifier(text, thread.identifier, identity);
+    procfs::readRecord(openLiveThread(processDirectory).directory.get(), "auxv", text);
+    return text;
 }
 
 }  // namespace
 
 void ForkCensus::begin() {
     const std::lock_guard lock(_mutex);
-    _identifiers.clear();
+    _programs.clear();
     _members.clear();
     _measured = 0;
     _complete = false;
 }
 
-void ForkCensus::add(int32_t pid, std::optional<uint64_t> identifier) {
+void ForkCensus::add(int32_t pid, uint64_t program) {
     const std::lock_guard lock(_mutex);
     ++_measured;
-    _add(pid, identifier);
+    _add(pid, program);
 }
 
 size_t ForkCensus::measured() const {
@@ -46,9 +44,9 @@ size_t ForkCensus::measured() const {
     return _measured;
 }
 
-void ForkCensus::_add(int32_t pid, std::optional<uint64_t> identifier) {
-    if (_identifiers.emplace(pid, identifier).second && identifier) {
-        ++_members[*identifier];
+void ForkCensus::_add(int32_t pid, uint64_t program) {
+    if (_programs.emplace(pid, program).second) {
+        ++_members[program];
     }
 }
 
@@ -56,9 +54,10 @@ void ForkCensus::_addOthers() {
     procfs::forEachEntry(_proc, ".", [&](int directory, const char* name) {
         std::string_view number = name;
         int32_t pid = 0;
-        if (procfs::takeNumber(number, pid) && number.empty() && !_identifiers.contains(pid)) {
+        if (procfs::takeNumber(number, pid) && number.empty() && !_programs.contains(pid)) {
             const procfs::Descriptor process = procfs::open(directory, name, O_PATH | O_DIRECTORY);
-            _add(pid, process ? identifierOf(process.get(), pid, _identity) : std::nullopt);
+            const std::string auxv = process ? auxiliaryVectorOf(process.get()) : "";
+            _add(pid, auxv.empty() ? 0 : _identity.bytes(auxv));
         }
         return true;
     });
@@ -70,6 +69,6 @@ bool ForkCensus::isAlone(int32_t pid) {
     if (!_complete) {
         _addOthers();
     }
-    const auto found = _identifiers.find(pid);
-    return found != _identifiers.end() && found->second && _members.at(*found->second) == 1;
+    const auto found = _programs.find(pid);
+    return found != _programs.end() && found->second != 0 && _members.at(found->second) == 1;
 }

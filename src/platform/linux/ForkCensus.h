@@ -2,7 +2,6 @@
 
 #include <cstdint>
 #include <mutex>
-#include <optional>
 #include <unordered_map>
 
 #include "platform/linux/ObjectIdentity.h"
@@ -10,28 +9,32 @@
 /// Which processes are the only ones of their exec: nobody shares their memory by fork, so that nothing has
 /// to be looked up page by page. Holds for one measurement: a child that is forked after the processes of the
 /// measurement were listed is not measured. Safe for use from several threads.
+///
+/// A program is known by its auxiliary vector, which forks have in common and which every exec makes anew, at
+/// random addresses. Where addresses are not random, runs of one program pass for each other's forks. Nothing
+/// is read from the processes' memory: that would wait for whoever has locked their memory maps.
 class ForkCensus {
 public:
     /// `proc` is a descriptor of /proc.
     ForkCensus(int proc, const ObjectIdentity& identity) : _proc(proc), _identity(identity) {}
 
     void begin();
-    /// A process that is measured, with its `randomBytesIdentifier`.
-    void add(int32_t pid, std::optional<uint64_t> identifier);
+    /// A process that is measured; `program` stands for its auxiliary vector, 0 where that is not known.
+    void add(int32_t pid, uint64_t program);
     /// How many were added.
     size_t measured() const;
     /// Of a process that was added. The first question looks at all the others of the system.
     bool isAlone(int32_t pid);
 
 private:
-    void _add(int32_t pid, std::optional<uint64_t> identifier);
+    void _add(int32_t pid, uint64_t program);
     void _addOthers();
 
     int _proc;
     const ObjectIdentity& _identity;
-    mutable std::mutex _mutex;  ///< guards what follows
-    std::unordered_map<int32_t, std::optional<uint64_t>> _identifiers;
-    std::unordered_map<uint64_t, size_t> _members;  ///< by identifier
+    mutable std::mutex _mutex;                        ///< guards what follows
+    std::unordered_map<int32_t, uint64_t> _programs;  ///< by pid
+    std::unordered_map<uint64_t, size_t> _members;    ///< by program
     size_t _measured = 0;
     bool _complete = false;
 };

@@ -83,7 +83,8 @@ LinuxTask::LinuxTask(LinuxRun& run, int32_t pid, ListedProcess listed)
       _startTime(listed.stat.startTime),
       _directory(std::move(listed.directory)),
       _threadId(pid),
-      _stat(std::move(listed.stat)) {}
+      _stat(std::move(listed.stat)),
+      _executable(std::move(listed.executable)) {}
 
 LiveThread openLiveThread(int processDirectory) {
     LiveThread found;
@@ -111,19 +112,10 @@ std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid) {
     }
     listed.stat = *stat;
     procfs::readRecord(listed.directory.get(), "auxv", listed.auxv);
-    return _openLookedAt(run, pid, std::move(listed));
+    return open(run, pid, std::move(listed));
 }
 
 std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid, ListedProcess listed) {
-    std::string commandLine = std::move(listed.commandLine);
-    auto task = _openLookedAt(run, pid, std::move(listed));
-    if (task != nullptr) {
-        task->_commandLine = std::move(commandLine);
-    }
-    return task;
-}
-
-std::unique_ptr<LinuxTask> LinuxTask::_openLookedAt(LinuxRun& run, int32_t pid, ListedProcess listed) {
     std::string auxv = std::move(listed.auxv);
     std::unique_ptr<LinuxTask> task(new LinuxTask(run, pid, std::move(listed)));
     if (task->_stat.threadEnded() && task->_chooseThread()) {
@@ -134,9 +126,6 @@ std::unique_ptr<LinuxTask> LinuxTask::_openLookedAt(LinuxRun& run, int32_t pid, 
         return nullptr;
     }
     task->_program = auxv.empty() ? 0 : run.identity.bytes(auxv);
-    if (run.mappingSource == MappingSource::cheapest) {
-        task->_exec = randomBytesIdentifier(auxv, task->_threadId, run.identity);
-    }
     return task;
 }
 
@@ -305,7 +294,7 @@ bool LinuxTask::sharesAnothersSpace() {
 void LinuxTask::survey() {
     _surveyOwnedObjects();
     if (_run.mappingSource == MappingSource::cheapest) {
-        _run.forkCensus.add(_pid, _exec);
+        _run.forkCensus.add(_pid, _program);
     }
 }
 

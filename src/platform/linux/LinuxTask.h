@@ -57,7 +57,7 @@ struct ListedProcess {
     procfs::Descriptor directory;
     procfs::ProcStat stat;
     std::string auxv;
-    std::string commandLine;
+    std::string executable;  ///< its path; empty where that is hidden
 };
 
 struct LiveThread {
@@ -86,8 +86,8 @@ public:
     int32_t pid() const { return _pid; }
     /// /proc/PID, opened with O_PATH.
     int directory() const { return _directory.get(); }
-    /// As the list of processes showed it; none when the process was not listed.
-    const std::optional<std::string>& commandLine() const { return _commandLine; }
+    /// As the list of processes showed it; empty when the process was not listed.
+    const std::string& executable() const { return _executable; }
     /// The same, or /proc/PID/task/TID of a thread that lives where the first one has ended.
     int memoryDirectory() const { return _thread ? _thread.get() : _directory.get(); }
 
@@ -118,7 +118,6 @@ public:
 
 private:
     LinuxTask(LinuxRun& run, int32_t pid, ListedProcess listed);
-    static std::unique_ptr<LinuxTask> _openLookedAt(LinuxRun& run, int32_t pid, ListedProcess listed);
 
     /// The directory to read memory through: that of a thread that lives.
     /// False when no thread of the process lives.
@@ -148,10 +147,9 @@ private:
     procfs::Descriptor _directory;
     int32_t _threadId;           ///< a thread that lives
     procfs::Descriptor _thread;  ///< its task/TID, when it is not the first one
-    std::optional<std::string> _commandLine;
-    procfs::ProcStat _stat;         ///< of that thread, as last seen
-    uint64_t _program = 0;          ///< stands for its auxv, which each exec makes anew; 0 for none
-    std::optional<uint64_t> _exec;  ///< see randomBytesIdentifier
+    procfs::ProcStat _stat;      ///< of that thread, as last seen
+    std::string _executable;
+    uint64_t _program = 0;  ///< stands for its auxv, which each exec makes anew; 0 for none
     std::optional<procfs::ProcStatus> _status;
     uint64_t _statusTime = 0;                 ///< nanoseconds of CLOCK_MONOTONIC
     std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live

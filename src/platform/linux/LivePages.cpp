@@ -7,6 +7,7 @@
 #include <array>
 #include <vector>
 
+#include "platform/MWProgress.h"
 #include "platform/linux/PageScan.h"
 
 PagemapEntry lookAtUntouchedPage(int procDirectory, uint64_t pageSize) {
@@ -37,7 +38,9 @@ int LivePages::_file() {
 bool LivePages::readPages(uint64_t address, std::span<PagemapEntry> entries) {
     const auto bytes = std::as_writable_bytes(entries);
     const auto offset = static_cast<off_t>(address / _facts.pageSize * sizeof(PagemapEntry));
-    if (pread(_file(), bytes.data(), bytes.size(), offset) != static_cast<ssize_t>(bytes.size())) {
+    const ssize_t count = pread(_file(), bytes.data(), bytes.size(), offset);
+    MWProgress::mark();
+    if (count != static_cast<ssize_t>(bytes.size())) {
         return false;
     }
     if (_facts.zeroFrame != 0) {

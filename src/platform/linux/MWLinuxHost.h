@@ -112,7 +112,8 @@ private:
     /// A record of a process; false with errno on failure, ESRCH when the process is gone.
     bool _readProcessFile(int32_t pid, const char* name, std::string& text);
     std::optional<procfs::ProcStat> _statOfPid(int32_t pid);
-    bool _readArguments(int32_t pid, std::string& executable, std::string& arguments);
+    /// Empty with errno where it is hidden.
+    std::string _executableOfPid(int32_t pid);
     std::optional<procfs::ProcStatus> _memoryStatusOfPid(int32_t pid);
 
     /// A copy that the caller gives back.

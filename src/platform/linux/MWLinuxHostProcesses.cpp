@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <cstring>
 
 #include "platform/linux/MWLinuxHost.h"
 
@@ -47,6 +46,26 @@ void setStartTime(proc_bsdinfo& record, uint64_t ticks) {
     const auto perSecond = static_cast<uint64_t>(sysconf(_SC_CLK_TCK));
     record.pbi_start_tvsec = ticks / perSecond;
     record.pbi_start_tvusec = ticks % perSecond * kMicroseconds / perSecond;
+}
+
+// The path of the executable, which keeps its name where it was replaced while it ran, without the mark that
+// the kernel adds. Empty with errno where it is hidden.
+std::string executableOf(int directory) {
+    constexpr std::string_view kDeleted = " (deleted)";
+    std::string path;
+    procfs::readLink(directory, "exe", path);
+    return path.ends_with(kDeleted) ? path.substr(0, path.size() - kDeleted.size()) : path;
+}
+
+// The program's file name. To read the command line is to read the process's memory, which waits for whoever
+// has locked its memory map; so that is asked for only where the executable is hidden.
+std::string programName(int directory, const std::string& executable) {
+    std::string commandLine;
+    if (executable.empty()) {
+        procfs::readRecord(directory, "cmdline", commandLine);
+        return procfs::nameFromCommandLine(commandLine);
+    }
+    return executable.substr(executable.rfind('/') + 1);
 }
 
 // The class byte of the executable.
@@ -166,8 +185,8 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     setStartTime(record, stat->startTime);
     copyText(record.pbi_comm, stat->comm);
     ListedProcess listed;
-    procfs::readRecord(directory, "cmdline", listed.commandLine);
-    copyText(record.pbi_name, procfs::nameFromCommandLine(listed.commandLine));
+    listed.executable = executableOf(directory);
+    copyText(record.pbi_name, programName(directory, listed.executable));
     listed.directory = std::move(opened);
     listed.stat = *stat;
     procfs::readRecord(directory, "auxv", listed.auxv);
@@ -201,44 +220,31 @@ int MWLinuxHost::sysctlArgumentMaximum(uint64_t& bytes) {
     return maximum > 0 ? 0 : -1;
 }
 
-// The arguments of a process that was listed a moment ago are those that it had then.
-bool MWLinuxHost::_readArguments(int32_t pid, std::string& executable, std::string& arguments) {
-    if (const LinuxTask* task = _taskOfPid(pid); task != nullptr && task->commandLine()) {
-        arguments = *task->commandLine();
-        return procfs::readLink(task->directory(), "exe", executable);
+// Of a process that was listed a moment ago it is the one that it had then.
+std::string MWLinuxHost::_executableOfPid(int32_t pid) {
+    if (const LinuxTask* task = _taskOfPid(pid); task != nullptr && !task->executable().empty()) {
+        return task->executable();
     }
     {
         const std::lock_guard lock(_listedMutex);
-        if (const auto listed = _listed.find(pid); listed != _listed.end()) {
-            arguments = listed->second.commandLine;
-            return procfs::readLink(listed->second.directory.get(), "exe", executable);
+        const auto listed = _listed.find(pid);
+        if (listed != _listed.end() && !listed->second.executable.empty()) {
+            return listed->second.executable;
         }
     }
     procfs::Descriptor opened;
     const int directory = _processDirectory(pid, opened);
-    if (directory < 0 || !procfs::readLink(directory, "exe", executable)) {
-        return false;
-    }
-    procfs::readRecord(directory, "cmdline", arguments);
-    return true;
+    return directory < 0 ? std::string() : executableOf(directory);
 }
 
-// The argument count, the executable's path, then the arguments. An executable that was replaced while it ran
-// keeps its name without the mark that the kernel adds.
+// Without the arguments: nobody asks for them, and see programName.
 int MWLinuxHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) {
-    std::string path;
-    std::string arguments;
-    if (!_readArguments(pid, path, arguments)) {
+    const std::string path = _executableOfPid(pid);
+    if (path.empty()) {
         return -1;
     }
-    constexpr std::string_view kDeleted = " (deleted)";
-    if (path.ends_with(kDeleted)) {
-        path.resize(path.size() - kDeleted.size());
-    }
-    const auto count = static_cast<int32_t>(std::count(arguments.begin(), arguments.end(), '\0'));
-    std::string bytes(sizeof(count), '\0');
-    std::memcpy(bytes.data(), &count, sizeof(count));
-    bytes.append(path).append(1, '\0').append(arguments);
+    std::string bytes(sizeof(int32_t), '\0');
+    bytes.append(path).append(1, '\0');
     length = std::min(area.size(), bytes.size());
     std::copy_n(bytes.begin(), length, area.begin());
     return 0;

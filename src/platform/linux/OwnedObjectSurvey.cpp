@@ -53,25 +53,22 @@ void OwnedObjectSurvey::begin() {
     const std::lock_guard lock(_mutex);
     _holdersOfObject.clear();
     _holders.clear();
+    _mappedFiles.clear();
     _segments.reset();
     _targets = std::make_unique<DescriptorTargets>(_system.shmemDevices);
 }
 
 void OwnedObjectSurvey::add(const ProcessIdentity& process, int directory) {
-    auto holder = std::make_unique<Holder>(Holder{
-        .process = process,
-        .objects = heldObjects(directory, {*_targets, _system.identity, _system.pageSize}),
-    });
+    HeldObjects objects = heldObjects(directory, {*_targets, _system.identity, _system.pageSize});
     const std::lock_guard lock(_mutex);
-    _addSysVSegments(*holder);
-    auto& known = _holders[process];
-    if (known != nullptr) {
+    _addSysVSegments(process, objects);
+    const auto [known, isNew] = _holders.try_emplace(process, std::move(objects));
+    if (!isNew) {
         return;
     }
-    for (const auto& [identifier, object] : holder->objects) {
-        _holdersOfObject[identifier].push_back(holder.get());
+    for (const auto& [identifier, object] : known->second) {
+        _holdersOfObject[identifier].push_back(process);
     }
-    known = std::move(holder);
 }
 
 bool OwnedObjectSurvey::knows(const ProcessIdentity& process) const {
@@ -87,13 +84,13 @@ void OwnedObjectSurvey::_readSysVSegments() {
     _ipcNamespace = procfs::readNamespace(procfs::open(_system.proc, "self", O_PATH).get(), "ipc");
 }
 
-void OwnedObjectSurvey::_addSysVSegments(Holder& holder) {
+void OwnedObjectSurvey::_addSysVSegments(const ProcessIdentity& process, HeldObjects& objects) {
     if (!_segments) {
         _readSysVSegments();
     }
     for (const procfs::SysVSegment& segment : *_segments) {
         if (segment.attached != 0 || segment.resident + segment.swapped == 0 ||
-            !canHaveMade(holder.process, segment)) {
+            !canHaveMade(process, segment)) {
             continue;
         }
         const OwnedObjectRecord record = {
@@ -103,49 +100,70 @@ void OwnedObjectSurvey::_addSysVSegments(Holder& holder) {
             .resident = segment.resident,
             .compressed = segment.swapped,
             .flags = OwnedObjectRecord::flagsFor(MWLedgerDefault, VM_PURGABLE_DENY)};
-        holder.objects.emplace(record.object_id, HeldObject{.record = record});
+        objects.emplace(record.object_id, HeldObject{.record = record});
     }
 }
 
-bool OwnedObjectSurvey::_maps(Holder& holder, const HeldObject& object) const {
-    if (!holder.mappedFiles) {
-        holder.mappedFiles.emplace();
-        const procfs::Descriptor directory =
-            procfs::open(_system.proc, std::to_string(holder.process.pid).c_str(), O_PATH | O_DIRECTORY);
-        std::vector<procfs::Vma> vmas;
-        if (directory && isStill(holder.process, directory.get())) {
-            vmas = mappingsOf(directory.get());
-        }
-        for (const procfs::Vma& vma : vmas) {
-            if (vma.resident() + vma.swap != 0) {
-                holder.mappedFiles->emplace(vma.device(), vma.inode);
-            }
+// Whether the walk of `process` shows the file. Not under the lock: to read mappings takes time, and can take
+// for ever.
+bool OwnedObjectSurvey::_maps(const ProcessIdentity& process, const HeldObject& object) {
+    std::shared_ptr<MappedFiles> files;
+    {
+        const std::lock_guard lock(_mutex);
+        files = _mappedFiles[process];
+    }
+    if (files == nullptr) {
+        files = std::make_shared<MappedFiles>(_mappedFilesOf(process));
+        const std::lock_guard lock(_mutex);
+        _mappedFiles[process] = files;
+    }
+    return files->contains({object.device, object.inode});
+}
+
+OwnedObjectSurvey::MappedFiles OwnedObjectSurvey::_mappedFilesOf(const ProcessIdentity& process) const {
+    const procfs::Descriptor directory =
+        procfs::open(_system.proc, std::to_string(process.pid).c_str(), O_PATH | O_DIRECTORY);
+    std::vector<procfs::Vma> vmas;
+    if (directory && isStill(process, directory.get())) {
+        vmas = mappingsOf(directory.get());
+    }
+    MappedFiles files;
+    for (const procfs::Vma& vma : vmas) {
+        if (vma.resident() + vma.swap != 0) {
+            files.emplace(vma.device(), vma.inode);
         }
     }
-    return holder.mappedFiles->contains({object.device, object.inode});
+    return files;
 }
 
-bool OwnedObjectSurvey::_isCharged(const Holder& holder, const HeldObject& object) {
-    return std::ranges::all_of(_holdersOfObject[object.record.object_id], [&](Holder* other) {
-        if (other == &holder) {
-            return true;
-        }
-        return ByIdentity()(holder.process, other->process) &&
-               !(object.canBeMapped() && _maps(*other, object));
-    });
-}
-
-std::vector<OwnedObjectRecord> OwnedObjectSurvey::objectsOf(const ProcessIdentity& process,
-                                                            const IsMapped& isMapped) {
+// The objects that the process holds, with the others that hold them, if it is the oldest of all.
+std::vector<OwnedObjectSurvey::Candidate> OwnedObjectSurvey::_candidatesOf(const ProcessIdentity& process) {
     const std::lock_guard lock(_mutex);
     const auto found = _holders.find(process);
     if (found == _holders.end()) {
         return {};
     }
+    std::vector<Candidate> candidates;
+    for (const auto& [identifier, object] : found->second) {
+        const std::vector<ProcessIdentity>& holders = _holdersOfObject[identifier];
+        const bool isOldest = std::ranges::none_of(
+            holders, [&](const ProcessIdentity& other) { return ByIdentity()(other, process); });
+        if (isOldest) {
+            candidates.push_back({object, holders});
+        }
+    }
+    return candidates;
+}
+
+std::vector<OwnedObjectRecord> OwnedObjectSurvey::objectsOf(const ProcessIdentity& process,
+                                                            const IsMapped& isMapped) {
     std::vector<OwnedObjectRecord> records;
     uint64_t socketBytes = 0;
-    for (const auto& [identifier, object] : found->second->objects) {
-        if ((object.canBeMapped() && isMapped(identifier)) || !_isCharged(*found->second, object)) {
+    for (const auto& [object, holders] : _candidatesOf(process)) {
+        const auto mapsIt = [&, held = &object](const ProcessIdentity& other) {
+            return other == process ? isMapped(held->record.object_id) : _maps(other, *held);
+        };
+        if (object.canBeMapped() && std::ranges::any_of(holders, mapsIt)) {
             continue;
         }
         if (object.isSocket()) {

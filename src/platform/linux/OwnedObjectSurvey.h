@@ -45,23 +45,21 @@ public:
 private:
     /// Device and inode of those that the walk of a process shows, which it does not for untouched mappings.
     using MappedFiles = std::set<std::pair<uint64_t, uint64_t>>;
-    struct Holder {
-        ProcessIdentity process;
-        HeldObjects objects;
-        std::optional<MappedFiles> mappedFiles = {};  ///< read when it is asked for
+    struct Candidate {
+        HeldObject object;
+        std::vector<ProcessIdentity> holders;  ///< all of them
     };
     struct ByIdentity {
         bool operator()(const ProcessIdentity& one, const ProcessIdentity& other) const {
             return std::pair(one.startTime, one.pid) < std::pair(other.startTime, other.pid);
         }
     };
-    /// Oldest first.
-    using Holders = std::map<ProcessIdentity, std::unique_ptr<Holder>, ByIdentity>;
 
     void _readSysVSegments();
-    void _addSysVSegments(Holder& holder);
-    bool _isCharged(const Holder& holder, const HeldObject& object);
-    bool _maps(Holder& holder, const HeldObject& object) const;
+    void _addSysVSegments(const ProcessIdentity& process, HeldObjects& objects);
+    std::vector<Candidate> _candidatesOf(const ProcessIdentity& process);
+    bool _maps(const ProcessIdentity& process, const HeldObject& object);
+    MappedFiles _mappedFilesOf(const ProcessIdentity& process) const;
 
     System _system;
 
@@ -71,6 +69,8 @@ private:
     /// Of the tool's own IPC namespace.
     std::optional<std::vector<procfs::SysVSegment>> _segments;
     uint64_t _ipcNamespace = 0;
-    Holders _holders;
-    std::unordered_map<uint64_t, std::vector<Holder*>> _holdersOfObject;
+    std::map<ProcessIdentity, HeldObjects, ByIdentity> _holders;
+    std::unordered_map<uint64_t, std::vector<ProcessIdentity>> _holdersOfObject;
+    std::map<ProcessIdentity, std::shared_ptr<MappedFiles>, ByIdentity>
+        _mappedFiles;  ///< as they are asked for
 };

@@ -2,6 +2,8 @@
 
 #include <sys/ioctl.h>
 
+#include "platform/MWProgress.h"
+
 namespace {
 
 // The headers of older systems do not have it.
@@ -35,6 +37,7 @@ int scanPages(int pagemap, const PageScan& scan, std::span<ScannedRange> ranges,
     arguments.categoryAnyOfMask = scan.anyOf;
     arguments.returnMask = scan.told;
     const int count = ioctl(pagemap, kPagemapScan, &arguments);
+    MWProgress::mark();
     walkEnd = arguments.walkEnd;
     return count;
 }

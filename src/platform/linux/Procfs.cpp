@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "platform/MWProgress.h"
 #include "platform/linux/ProcText.h"
 
 namespace procfs {
@@ -40,6 +41,7 @@ ptrdiff_t readSome(int descriptor, std::span<char> buffer) {
     do {
         count = ::read(descriptor, buffer.data(), buffer.size());
     } while (count < 0 && errno == EINTR);
+    MWProgress::mark();
     return count;
 }
 
