@@ -66,8 +66,11 @@ bool appendFileFormatter(Formatters& formatters, const std::optional<std::string
 /// Text first. None when an output file cannot be written; the user has then been told which.
 std::optional<Formatters> createFormatters(const MWMemweightArgs& args) {
     Formatters formatters;
-    formatters.push_back(std::make_unique<MWOutputFormatterText>(MWTextStyle{
-        .summaryFormat = args.summaryFormat(), .options = args.textOptions(), .sort = args.textSort()}));
+    formatters.push_back(std::make_unique<MWOutputFormatterText>(
+        MWTextStyle{.summaryFormat = args.summaryFormat(),
+                    .options = args.textOptions(),
+                    .sort = args.textSort(),
+                    .isForTerminal = MWHostInterface::current().isatty(STDOUT_FILENO)}));
     const bool created = appendFileFormatter<MWOutputFormatterJSON>(formatters, args.JSONOutputFile(),
                                                                     "Unable to create JSON output\n") &&
                          appendFileFormatter<MWOutputFormatterStatpack>(formatters, args.statpackOutputFile(),

@@ -44,7 +44,7 @@ struct Arguments {
 };
 
 bool fail(std::string_view subject, std::string_view what) {
-    fmt::fprintf(stderr, "memweight-heapsnap: %s: %s\n", MWTerminalText(subject), what);
+    fmt::fprintf(stderr, "memweight-heapsnap: %s: %s\n", MWErrorText(subject), what);
     return false;
 }
 

@@ -55,8 +55,7 @@ void reportNoProcessList() {
 
 void reportUnreadable(int32_t pid, const std::optional<std::string>& name) {
     if (name) {
-        fmt::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", MWTerminalText(*name),
-                     pid);
+        fmt::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", MWErrorText(*name), pid);
     } else {
         fmt::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", pid);
     }

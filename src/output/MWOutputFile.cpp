@@ -55,7 +55,7 @@ int MWOutputFile::finish() {
 
 void MWOutputFile::close() {
     if (const int error = finish(); error != 0) {
-        fmt::fprintf(stderr, "memweight: %s: %s\n", MWTerminalText(_path),
+        fmt::fprintf(stderr, "memweight: %s: %s\n", MWErrorText(_path),
                      std::generic_category().message(error));
     }
 }

@@ -21,6 +21,7 @@ MWOutputFormatterText::MWOutputFormatterText(MWTextStyle style, std::FILE* outpu
     : _summaryFormat(style.summaryFormat),
       _options(style.options),
       _sort(std::move(style.sort)),
+      _isForTerminal(style.isForTerminal),
       _output(output) {
     if (_shows(MWTextShowSwapped)) {
         _swappedColumnName = "(Swapped)";
@@ -28,6 +29,10 @@ MWOutputFormatterText::MWOutputFormatterText(MWTextStyle style, std::FILE* outpu
     if (_shows(MWTextShowWired)) {
         _wiredColumnName = "(Wired)";
     }
+}
+
+std::string MWOutputFormatterText::_shown(std::string_view text) const {
+    return _isForTerminal ? MWTerminalText(text) : std::string(text);
 }
 
 void MWOutputFormatterText::startAtTime(const MWTime& time) {
@@ -45,8 +50,8 @@ void MWOutputFormatterText::printProcessHeader(const MWProcess& process) {
     _processCount = static_cast<uint8_t>(std::min(_processCount + 1, 2));
     _pageSize = process.pageSize();
     _printSeparator("\n");
-    fmt::fprintf(_output, "%s: %s-bit%s", MWTerminalText(process.displayString()),
-                 process.is64bit() ? "64" : "32", process.isTranslated() ? " (translated)" : "");
+    fmt::fprintf(_output, "%s: %s-bit%s", _shown(process.displayString()), process.is64bit() ? "64" : "32",
+                 process.isTranslated() ? " (translated)" : "");
     _printMessages("\nWarnings were encountered while examining the process.\n", process.warnings());
     _printMessages("\nErrors were encountered while examining the process. No results gathered.\n",
                    process.errors());
@@ -83,7 +88,7 @@ void MWOutputFormatterText::_printSharers(const MWSharedCategoriesCall& call) co
     std::string others;
     for (const MWProcess* member : members) {
         if (member != &call.forProcess) {
-            others += (others.empty() ? " " : ", ") + MWTerminalText(member->displayString());
+            others += (others.empty() ? " " : ", ") + _shown(member->displayString());
         }
     }
     fmt::fprintf(_output, "Shared with%s:\n", others);
@@ -142,7 +147,7 @@ void MWOutputFormatterText::printAuxData(const MWAuxDataContainer& auxData) cons
 
 void MWOutputFormatterText::_printAuxData(const MWAuxDataContainer& auxData, size_t withIndent) const {
     for (const auto& [key, datum] : auxData.elements()) {
-        const std::string name = std::string(withIndent, '\t') + MWTerminalText(key);
+        const std::string name = std::string(withIndent, '\t') + _shown(key);
         if (datum->isContainer()) {
             fmt::fprintf(_output, "%s:\n", name);
             _printAuxData(static_cast<const MWAuxDataContainer&>(*datum), withIndent + 1);
@@ -160,7 +165,7 @@ void MWOutputFormatterText::_printMessages(const char* heading,
     }
     fmt::fprintf(_output, "%s", heading);
     for (const std::string& message : messages) {
-        fmt::fprintf(_output, "\t%s\n", MWTerminalText(message));
+        fmt::fprintf(_output, "\t%s\n", _shown(message));
     }
 }
 

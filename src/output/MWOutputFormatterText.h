@@ -29,11 +29,11 @@ struct MWTextStyle {
     MWSummaryFormat summaryFormat;
     MWTextOptions options;
     std::string sort;
+    bool isForTerminal = false;  ///< names, paths and messages as MWTerminalText
 };
 
 /// The human-readable report, on a stream that it borrows (standard output in the program). Write errors are
-/// ignored. A measurement of a single process gets neither a summary table nor global auxiliary data. Names,
-/// paths and messages are printed as MWTerminalText.
+/// ignored. A measurement of a single process gets neither a summary table nor global auxiliary data.
 class MWOutputFormatterText : public MWOutputFormatter {
 public:
     /// (initWithSummaryFormat:options:sort:)
@@ -95,6 +95,8 @@ private:
     std::string _spanlistHeader() const;
     std::string _spanlistRow(const MWMemoryRegion& region, uint64_t pageSize) const;
 
+    /// A name, a path or a message, as it is printed.
+    std::string _shown(std::string_view text) const;
     void _printSeparator(const char* end) const;
     void _printSharers(const MWSharedCategoriesCall& call) const;
     void _printMessages(const char* heading, const std::vector<std::string>& messages) const;
@@ -117,6 +119,7 @@ private:
     MWSummaryFormat _summaryFormat;
     MWTextOptions _options;
     std::string _sort;
+    bool _isForTerminal;
     std::FILE* _output;
     // Texts that have been made before.
     mutable std::unordered_map<uint64_t, std::string> _sizeTexts;

@@ -7,7 +7,6 @@
 
 #include "model/MWMemoryRegion.h"
 #include "output/MWOutputFormatterText.h"
-#include "platform/MWTerminalText.h"
 #include "process/MWProcess.h"
 
 namespace {
@@ -36,7 +35,7 @@ void writePiece(std::string& text, std::FILE* output) {
 void MWOutputFormatterText::printSpanlistLikeOutputForProcess(const MWProcess& process,
                                                               const MWMemoryRegionList& regions) {
     _verbose = true;
-    std::string text = MWTerminalText(process.displayString()) + "\n\n" + _spanlistHeader();
+    std::string text = _shown(process.displayString()) + "\n\n" + _spanlistHeader();
     for (const auto& region : regions) {
         text += _spanlistRow(*region, process.pageSize());
         if (text.size() >= kPieceSize) {
@@ -74,9 +73,9 @@ std::string MWOutputFormatterText::_spanlistRow(const MWMemoryRegion& region, ui
     if (_shows(MWTextShowWired)) {
         appendPages(region.wiredSize());
     }
-    row += "   " + MWTerminalText(region.name());
+    row += "   " + _shown(region.name());
     if (const auto detail = _truncatedNameForString(region.detailedName())) {
-        row += " " + MWTerminalText(*detail);
+        row += " " + _shown(*detail);
     }
     return row + "\n";
 }

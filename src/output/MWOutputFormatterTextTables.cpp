@@ -11,7 +11,6 @@
 
 #include "output/MWOutputFormatterText.h"
 #include "platform/MWInvariant.h"
-#include "platform/MWTerminalText.h"
 
 namespace {
 
@@ -208,7 +207,7 @@ void MWOutputFormatterText::_appendRow(std::string& table, const MWCategoryTotal
                                .reclaimable = _sizeText(total.reclaimable),
                                .wired = _sizeText(total.wired)});
     appendRight(table, fmt::format_int(static_cast<int32_t>(total.regions)).c_str(), kRegionsWidth);
-    table.append("    ").append(MWTerminalText(category)).append(MWTerminalText(detail)) += '\n';
+    table.append("    ").append(_shown(category)).append(_shown(detail)) += '\n';
 }
 
 // Most sizes of a report are few and small, and are written many times over. In pages one size has another

@@ -1,9 +1,13 @@
 #include "platform/MWTerminalText.h"
 
+#include <fmt/format.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
 
+#include "platform/MWHostInterface.h"
 #include "platform/MWUTF8.h"
 
 namespace {
@@ -18,6 +22,15 @@ size_t printableLength(std::string_view text) {
     return isC0Control || isC1Control ? 0 : length;
 }
 
+/// As listings of files have them.
+std::string escaped(char byte) {
+    constexpr std::string_view kWithLetter = "\a\b\t\n\v\f\r";
+    constexpr std::string_view kLetters = "abtnvfr";
+    const size_t place = kWithLetter.find(byte);
+    return place == std::string_view::npos ? fmt::format("\\{:03o}", static_cast<uint8_t>(byte))
+                                           : fmt::format("\\{}", kLetters[place]);
+}
+
 }  // namespace
 
 std::string MWTerminalText(std::string_view text) {
@@ -25,8 +38,16 @@ std::string MWTerminalText(std::string_view text) {
     printable.reserve(text.size());
     while (!text.empty()) {
         const size_t length = printableLength(text);
-        printable += length == 0 ? "?" : text.substr(0, length);
+        if (length == 0) {
+            printable += escaped(text.front());
+        } else {
+            printable += text.substr(0, length);
+        }
         text.remove_prefix(std::max<size_t>(length, 1));
     }
     return printable;
+}
+
+std::string MWErrorText(std::string_view text) {
+    return MWHostInterface::current().isatty(STDERR_FILENO) ? MWTerminalText(text) : std::string(text);
 }

@@ -3,6 +3,10 @@
 #include <string>
 #include <string_view>
 
-/// `text` with every control character, and every byte that is not part of well-formed UTF-8,
-/// replaced by '?'. Names and paths come from the measured processes, which may choose them freely.
+/// `text` as a terminal may be shown it: control characters, and bytes that are not part of well-formed UTF-8,
+/// as the escapes of C, "\\n" or "\\033". Names and paths come from the measured processes, which may choose
+/// them freely.
 std::string MWTerminalText(std::string_view text);
+
+/// `text` as it goes to standard error: escaped when that is a terminal, else as it is.
+std::string MWErrorText(std::string_view text);

@@ -229,7 +229,7 @@ void MWKernelProcess::_setNameForRegion(MWMemoryRegion& region, const mach_memor
 }
 
 void MWKernelProcess::_printFailure(const char* operation, kern_return_t result) const {
-    fmt::fprintf(stderr, "%s: %s: %s\n", MWTerminalText(displayString()), operation,
+    fmt::fprintf(stderr, "%s: %s: %s\n", MWErrorText(displayString()), operation,
                  MWHostInterface::current().mach_error_string(result));
 }
 

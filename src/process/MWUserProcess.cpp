@@ -106,7 +106,7 @@ void MWUserProcess::gatherData() {
     }
     if (!_configurePageSize()) {
         fmt::fprintf(stderr, "skipping process %s due to an error configuring page size for analysis\n",
-                     MWTerminalText(displayString()));
+                     MWErrorText(displayString()));
         return;
     }
     if (!hiddenFromDisplay()) {
@@ -144,11 +144,11 @@ void MWUserProcess::_addTaskWarnings() {
 void MWUserProcess::_addErrnoWarningWithDescription(std::string_view description) {
     const std::string text = std::generic_category().message(errno).substr(0, kLongestErrorText);
     std::string message = fmt::format("{}: {} - {}", displayString(), description, text);
-    fmt::fprintf(stderr, "%s\n", MWTerminalText(message));
+    fmt::fprintf(stderr, "%s\n", MWErrorText(message));
     _addWarning(std::move(message));
 }
 
 void MWUserProcess::_printBailingOut() const {
     fmt::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
-                 MWTerminalText(displayString()));
+                 MWErrorText(displayString()));
 }

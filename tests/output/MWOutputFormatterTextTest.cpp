@@ -28,7 +28,8 @@ std::string printed(const MWTextStyle& style, Print&& print) {
     return result;
 }
 
-const MWTextStyle kFormatted = {.summaryFormat = MWSummaryFormat::formatted, .options = 0, .sort = "Dirty"};
+const MWTextStyle kFormatted = {
+    .summaryFormat = MWSummaryFormat::formatted, .options = 0, .sort = "Dirty", .isForTerminal = true};
 const MWTextStyle kBytesWide = {
     .summaryFormat = MWSummaryFormat::bytes, .options = MWTextWide, .sort = "Category"};
 const MWTextStyle kPages = {
@@ -169,7 +170,7 @@ TEST(MWOutputFormatterText, ListsProcessesWithWarningsAndErrors) {
     EXPECT_EQ(lists({&b, &a}, {"stopped\x1b"}),
               warnings +
                   "\nErrors were encountered while examining the following processes:\n\tb\n\ta\n"
-                  "\nErrors were encountered:\n\tstopped?\n"
+                  "\nErrors were encountered:\n\tstopped\\033\n"
                   "\nDue to errors, summary results may be invalid\n");
 }
 
@@ -242,7 +243,7 @@ TEST(MWOutputFormatterText, RegionsAreListedInPages) {
             formatter.printSpanlistLikeOutputForProcess(process, regions);
         });
     };
-    EXPECT_EQ(listing(kFormatted), R"(editor? [10]
+    EXPECT_EQ(listing(kFormatted), R"(editor\033 [10]
 
            start                end  [objectid]      VRT     DRT     CLN     RCL   tag (detail)
       ----------         ----------  ----------    -----   -----   -----   -----   ------------
@@ -250,7 +251,7 @@ TEST(MWOutputFormatterText, RegionsAreListedInPages) {
         unmapped -         unmapped [         7]       1       1       0       0   page table
 
 )");
-    EXPECT_EQ(listing(kBytesWide), R"(editor? [10]
+    EXPECT_EQ(listing(kBytesWide), std::string("editor\x1b [10]") + R"(
 
            start                end  [objectid]      VRT     DRT     SWP     CLN     RCL    WIRE   tag (detail)
       ----------         ----------  ----------    -----   -----   -----   -----   -----   -----   ------------

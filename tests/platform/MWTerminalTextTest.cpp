@@ -1,20 +1,40 @@
 #include "platform/MWTerminalText.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "support/FakeHost.h"
 
 namespace {
 
 TEST(MWTerminalText, LetsNothingThroughThatSteersATerminal) {
-    EXPECT_EQ(MWTerminalText("plain \"text\" ~"), "plain \"text\" ~");
-    EXPECT_EQ(MWTerminalText("\x1b[31mred\n\t\x7f"), "?[31mred???");
-    EXPECT_EQ(MWTerminalText("é \u20ac \U0001F600"), "é \u20ac \U0001F600");
-    EXPECT_EQ(MWTerminalText("\u009b31m"), "??31m") << "the control sequence introducer as UTF-8";
-    EXPECT_EQ(MWTerminalText("\x9b"
-                             "31m\xff"),
-              "?31m?");
-    EXPECT_EQ(MWTerminalText("cut \xe2\x82"), "cut ??");
-    EXPECT_EQ(MWTerminalText("\xed\xa0\x80 \xf4\x90\x80\x80"), "??? ????") << "no characters";
-    EXPECT_EQ(MWTerminalText("\xc1\x9b \xe0\x82\x9b \xf0\x80\x80\x80"), "?? ??? ????") << "overlong forms";
+    const std::vector<std::pair<std::string, std::string>> cases = {
+        {R"(plain "text" \ ~ é)", R"(plain "text" \ ~ é)"},
+        {"\u20ac \U0001F600", "\u20ac \U0001F600"},
+        {"\x1b[31mred\a\b\t\n\v\f\r\x7f", R"(\033[31mred\a\b\t\n\v\f\r\177)"},
+        {std::string(1, '\0') + "1", R"(\0001)"},
+        {"\u009b31m", R"(\302\23331m)"},  // the control sequence introducer as UTF-8
+        {"\x9b\x33\xff", R"(\2333\377)"},
+        {"cut \xe2\x82", R"(cut \342\202)"},
+        {"\xed\xa0\x80 \xf4\x90\x80\x80", R"(\355\240\200 \364\220\200\200)"},  // no characters
+        {"\xc1\x9b \xe0\x82\x9b", R"(\301\233 \340\202\233)"},                  // overlong forms
+    };
+    for (const auto& [text, shown] : cases) {
+        EXPECT_EQ(MWTerminalText(text), shown);
+    }
+}
+
+TEST(MWTerminalText, AnErrorIsEscapedForATerminalAlone) {
+    FakeHost host;
+    EXPECT_EQ(MWErrorText("a\033b"), "a\033b");
+    host.terminals = {STDOUT_FILENO};
+    EXPECT_EQ(MWErrorText("a\033b"), "a\033b");
+    host.terminals = {STDERR_FILENO};
+    EXPECT_EQ(MWErrorText("a\033b"), "a\\033b");
 }
 
 }  // namespace
