@@ -3,10 +3,14 @@
 #include <fmt/printf.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
+#include <filesystem>
+#include <iterator>
 #include <memory>
 #include <optional>
 #include <string>
+#include <system_error>
 #include <vector>
 
 #include "analysis/MWMemweight.h"
@@ -16,6 +20,7 @@
 #include "output/MWOutputFormatterJSON.h"
 #include "output/MWOutputFormatterStatpack.h"
 #include "platform/MWHostInterface.h"
+#include "platform/MWTerminalText.h"
 
 namespace {
 
@@ -61,6 +66,34 @@ bool appendFileFormatter(Formatters& formatters, const std::optional<std::string
     }
     std::fputs(failure, stderr);
     return false;
+}
+
+/// Two names of one file, there already or not yet. Devices and pipes take everything.
+bool areOneFile(const std::string& one, const std::string& other) {
+    std::error_code error;
+    const auto status = std::filesystem::status(one, error);
+    if (!std::filesystem::exists(status)) {
+        return one == other;
+    }
+    return std::filesystem::is_regular_file(status) && std::filesystem::equivalent(one, other, error);
+}
+
+/// A file that two outputs would be written to, or that is a heapsnap to be read and an output as well.
+std::optional<std::string> fileOfTwoUses(const MWMemweightArgs& args) {
+    std::vector<std::string> others;
+    std::ranges::copy_if(
+        args.potentialTargetProcesses(), std::back_inserter(others),
+        [](const std::string& target) { return MWHostInterface::current().fileExists(target); });
+    for (const auto& output : {args.JSONOutputFile(), args.statpackOutputFile()}) {
+        const auto isSame = [&output](const std::string& other) { return areOneFile(other, *output); };
+        if (output && std::ranges::any_of(others, isSame)) {
+            return output;
+        }
+        if (output) {
+            others.push_back(*output);
+        }
+    }
+    return std::nullopt;
 }
 
 /// Text first. None when an output file cannot be written; the user has then been told which.
@@ -149,11 +182,16 @@ int MWMemweightMain(int argc, char* const argv[], MWKeptUntilExit* kept) {
 
 int MWRunMemweight(MWMemweightArgs& args, MWKeptUntilExit* kept) {
     // Before the formatters are made: a document records the mode when it is opened.
-    if (args.shouldGetPhysMemweightBreakdown()) {
+    const bool breaksDown = args.shouldGetPhysMemweightBreakdown();
+    if (breaksDown) {
         MWMemweight::setBreakDownPhysMemweight(true);
     }
     if (needsRoot(args) && MWHostInterface::current().geteuid() != 0) {
         std::fputs("Must run as root.\n", stderr);
+        return kFailure;
+    }
+    if (const auto path = fileOfTwoUses(args)) {
+        fmt::fprintf(stderr, "%s would be both read and written, or written twice.\n", MWErrorText(*path));
         return kFailure;
     }
     // Before the targets are resolved: an output that cannot be written fails before any process is read.
@@ -164,6 +202,10 @@ int MWRunMemweight(MWMemweightArgs& args, MWKeptUntilExit* kept) {
     auto targets = resolveTargets(args);
     if (!targets) {
         return removeOutputFiles(args);
+    }
+    if (breaksDown && !args.shouldGetPhysMemweightBreakdown()) {
+        std::fputs("NOTICE: The heapsnap was recorded with --vmObjectDirty. Give that option here as well.\n",
+                   stderr);
     }
     bool succeeded = true;
     if (args.sampleInterval() != 0) {
@@ -178,5 +220,5 @@ int MWRunMemweight(MWMemweightArgs& args, MWKeptUntilExit* kept) {
     for (const auto& formatter : *formatters) {
         formatter->close();
     }
-    return succeeded ? kSuccess : kFailure;
+    return succeeded ? kSuccess : removeOutputFiles(args);
 }

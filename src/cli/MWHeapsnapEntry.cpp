@@ -7,9 +7,11 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -17,10 +19,12 @@
 
 #include "cli/MWVersion.h"
 #include "output/MWHeapsnapWriter.h"
-#include "output/MWOutputFile.h"
+#include "output/MWOutputPlace.h"
+#include "output/MWWholeFile.h"
 #include "platform/MWHostInterface.h"
 #include "platform/MWPhysMemweightSwitch.h"
 #include "platform/MWTerminalText.h"
+#include "platform/MWWorkQueue.h"
 #include "process/MWRecordedProcess.h"
 
 namespace {
@@ -111,28 +115,16 @@ std::string defaultFile(const MWProcess& process) {
     return name + "-" + std::to_string(process.pid()) + ".heapsnap";
 }
 
-/// Whether a file of this name may be written: another one is replaced only by force, and nothing else than a
-/// file ever.
-bool mayWrite(const std::string& path, bool force) {
+/// Another file is replaced only by force, and nothing else than a file ever.
+bool mayWrite(const MWOutputPlace& place, const std::string& path, bool force) {
     struct stat status = {};
-    if (lstat(path.c_str(), &status) != 0) {
+    if (fstatat(place.folder(), place.name().c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
         return errno == ENOENT || fail(path, errno);
     }
     if (!S_ISREG(status.st_mode)) {
         return fail(path, "not a regular file");
     }
     return force || fail(path, EEXIST);
-}
-
-bool rename(const std::string& from, const std::string& to, bool force) {
-    const auto rename = [&](unsigned flags) {
-        return renameat2(AT_FDCWD, from.c_str(), AT_FDCWD, to.c_str(), flags) == 0;
-    };
-    if (rename(force ? 0 : RENAME_NOREPLACE)) {
-        return true;
-    }
-    // Not every file system can tell the two apart; that there was no such file has been seen before.
-    return (!force && errno == EINVAL && rename(0)) || fail(to, errno);
 }
 
 bool writeSnapshot(MWRecordedProcess& process, MWOutputFile& file) {
@@ -149,25 +141,32 @@ bool writeSnapshot(MWRecordedProcess& process, MWOutputFile& file) {
     return errors.empty();
 }
 
-bool save(MWRecordedProcess& process, const std::string& path, bool force) {
-    if (!mayWrite(path, force)) {
+/// On a thread that can be given up, which then keeps what it works on.
+bool writeWatched(const std::shared_ptr<MWRecordedProcess>& process,
+                  const std::shared_ptr<MWWholeFile>& file) {
+    const auto isWhole = std::make_shared<std::atomic<bool>>(false);
+    const MWConcurrentQueue queue("org.memweight.memweight.heapsnap", QOS_CLASS_USER_INITIATED);
+    const auto stuck = queue.apply(1, [=](size_t) { *isWhole = writeSnapshot(*process, file->contents()); });
+    return stuck.empty() ? isWhole->load() : fail(process->displayString(), "not responding");
+}
+
+bool save(const std::shared_ptr<MWRecordedProcess>& process, const std::string& path, bool force) {
+    auto place = MWOutputPlace::find(path);
+    if (!place) {
+        return fail(path, errno);
+    }
+    if (!mayWrite(*place, path, force)) {
         return false;
     }
-    const std::string temporary = path + ".tmp" + std::to_string(getpid());
-    const auto file = MWOutputFile::createNew(temporary);
+    const std::shared_ptr<MWWholeFile> file = MWWholeFile::create(*std::move(place));
     if (file == nullptr) {
         return fail(path, errno);
     }
-    const bool isWhole = writeSnapshot(process, *file);
-    const int error = file->finish();
-    if (error != 0) {
-        fail(path, error);
+    if (!writeWatched(process, file)) {
+        return false;
     }
-    const bool isSaved = isWhole && error == 0 && rename(temporary, path, force);
-    if (!isSaved) {
-        unlink(temporary.c_str());
-    }
-    return isSaved;
+    const int error = file->publish(force);
+    return error == 0 || fail(path, error);
 }
 
 }  // namespace
@@ -186,6 +185,6 @@ int MWHeapsnapMain(int argc, char* const argv[]) {
         fail(std::to_string(arguments->pid), "unable to read this process (try as root?)");
         return kFailure;
     }
-    return save(*process, arguments->file.value_or(defaultFile(*process)), arguments->force) ? kSuccess
-                                                                                             : kFailure;
+    return save(process, arguments->file.value_or(defaultFile(*process)), arguments->force) ? kSuccess
+                                                                                            : kFailure;
 }

@@ -11,8 +11,6 @@
 
 namespace {
 
-constexpr std::string_view kReplacementCharacter = "\xEF\xBF\xBD";
-
 /// Whether the byte stands for itself and is a character of its own.
 bool isPlain(char c) {
     const auto byte = static_cast<uint8_t>(c);
@@ -45,7 +43,7 @@ void appendEscaped(std::string& to, char c) {
 size_t appendSpecial(std::string& to, std::string_view text) {
     const size_t length = MWUTF8CharacterLength(text);
     if (length == 0) {
-        to += kReplacementCharacter;
+        fmt::format_to(std::back_inserter(to), "\\\\x{:02x}", static_cast<uint8_t>(text.front()));
         return 1;
     }
     if (length == 1) {

@@ -6,26 +6,18 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <optional>
 #include <system_error>
 #include <utility>
 
+#include "output/MWOutputPlace.h"
 #include "platform/MWTerminalText.h"
 
-std::unique_ptr<MWOutputFile> MWOutputFile::_open(const std::string& path, int flags) {
-    constexpr mode_t kEverybodyByUmask = 0666;
-    const int descriptor = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | flags, kEverybodyByUmask);
-    if (descriptor < 0) {
-        return nullptr;
-    }
-    return std::unique_ptr<MWOutputFile>(new MWOutputFile(path, descriptor));
-}
-
 std::unique_ptr<MWOutputFile> MWOutputFile::create(const std::string& path) {
-    return _open(path, O_TRUNC);
-}
-
-std::unique_ptr<MWOutputFile> MWOutputFile::createNew(const std::string& path) {
-    return _open(path, O_EXCL);
+    constexpr unsigned kEverybodyByUmask = 0666;
+    const auto place = MWOutputPlace::find(path);
+    const int descriptor = place ? place->open(O_CREAT | O_TRUNC, kEverybodyByUmask) : -1;
+    return descriptor < 0 ? nullptr : std::make_unique<MWOutputFile>(path, descriptor);
 }
 
 MWOutputFile::~MWOutputFile() {
@@ -35,6 +27,7 @@ MWOutputFile::~MWOutputFile() {
 }
 
 void MWOutputFile::write(std::string_view bytes) {
+    const size_t whole = bytes.size();
     while (!bytes.empty() && _error == 0) {
         const ssize_t count = ::write(_descriptor, bytes.data(), bytes.size());
         if (count >= 0) {
@@ -42,6 +35,12 @@ void MWOutputFile::write(std::string_view bytes) {
         } else if (errno != EINTR) {
             _error = errno;
         }
+    }
+    if (bytes.empty()) {
+        _size += static_cast<off_t>(whole);
+    } else if (_error != 0 && bytes.size() != whole) {
+        // Nothing that can be cut, a pipe for example, keeps the part of a piece that it has got.
+        [[maybe_unused]] const int ignored = ftruncate(_descriptor, _size);
     }
 }
 

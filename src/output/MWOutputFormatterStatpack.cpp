@@ -110,6 +110,7 @@ void MWOutputFormatterStatpack::endAtTime(const MWTime& time) {
     const uint64_t milliseconds = elapsed / kPerMillisecond;
     spwriter_new_value(*_writer, "gather_duration", spunit_ms, static_cast<double>(milliseconds));
     spwriter_record_tag(*_writer, sptag_context);
+    spwriter_flush(*_writer);
 }
 
 void MWOutputFormatterStatpack::close() {

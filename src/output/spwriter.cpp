@@ -133,6 +133,10 @@ void spwriter_record_tag(spwriter& writer, sptag tag) {
     writer.value.tags += tag == sptag_summary ? "\"summary\"" : "\"context\"";
 }
 
+void spwriter_flush(spwriter& writer) {
+    writeGroup(writer);
+}
+
 void spwriter_close(spwriter_ptr writer) {
     writeGroup(*writer);
     writer->file->close();

@@ -5,11 +5,11 @@
 #include <string_view>
 
 // Writer of statpack files: metrics of a run as JSON Lines. The first line is the recording; every other line
-// is one value, with the group it belongs to. A group reaches the file whole, when the next one begins or the
-// file is closed, so that whatever is in the file at any moment is whole lines.
+// is one value, with the group it belongs to. A group reaches the file whole, when the next one begins, by
+// spwriter_flush or when the file is closed, so that whatever is in the file at any moment is whole lines.
 //
-// Names and values are any bytes; what is not UTF-8 is written as U+FFFD. Nothing here fails: a write error
-// is told when the file is closed, and what follows it is dropped.
+// Names and values are any bytes, written as by MWAppendJSONString. Nothing here fails: a write error is told
+// when the file is closed, and what follows it is dropped.
 
 struct spwriter;
 struct spwriter_release {
@@ -40,5 +40,7 @@ void spwriter_new_value(spwriter& writer, std::string_view metric, spunit unit, 
 void spwriter_record_variable_str(spwriter& writer, std::string_view name, std::string_view value);
 void spwriter_record_label_str(spwriter& writer, std::string_view name, std::string_view value);
 void spwriter_record_tag(spwriter& writer, sptag tag);
+/// The group is complete: a run that is killed later leaves it in the file.
+void spwriter_flush(spwriter& writer);
 /// Writes what there is left and tells a write error on standard error.
 void spwriter_close(spwriter_ptr writer);

@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <iterator>
 #include <limits>
+#include <new>
 #include <nlohmann/json.hpp>
 #include <span>
 #include <system_error>
@@ -410,7 +411,7 @@ MWError fileError(int code) {
 
 }  // namespace
 
-HeapsnapReader::Result HeapsnapReader::_read(const Source& source) {
+HeapsnapReader::Result HeapsnapReader::_read(const Source& source) try {
     Parser parser;
     ByteIterator::Buffer buffer(source);
     if (!nlohmann::json::sax_parse(ByteIterator(buffer), ByteIterator(), &parser)) {
@@ -420,6 +421,8 @@ HeapsnapReader::Result HeapsnapReader::_read(const Source& source) {
     reader->_process = std::move(parser.document);
     reader->_regions = std::move(parser.regions);
     return reader;
+} catch (const std::bad_alloc&) {
+    return tl::make_unexpected(fileError(ENOMEM));
 }
 
 HeapsnapReader::Result HeapsnapReader::open(std::string_view bytes) {

@@ -61,6 +61,10 @@ void MWRecordedProcess::record(const std::function<void(const HeapsnapRegion&)>&
     _addTaskWarnings();
 }
 
+void MWRecordedProcess::_processMachVMError(kern_return_t result, MWExpectedError) {
+    MWUserProcess::_processMachVMError(result, {.expectingErrorOnExit = KERN_SUCCESS});
+}
+
 HeapsnapRegion MWRecordedProcess::_regionOf(MWImageEnumerator& images, const MWWalkedRegion& walked) const {
     const auto bytes = [this](uint64_t pages) { return MWSaturatingMultiply(pages, pageSize()); };
     const vm_region_submap_info_64& info = walked.info;

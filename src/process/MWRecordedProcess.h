@@ -19,6 +19,10 @@ public:
     /// process's errors.
     void record(const std::function<void(const HeapsnapRegion&)>& take);
 
+protected:
+    /// Also of a process that has ended: what was saved of it is not the whole.
+    void _processMachVMError(kern_return_t result, MWExpectedError expected) override;
+
 private:
     MWRecordedProcess() = default;
     HeapsnapRegion _regionOf(MWImageEnumerator& images, const MWWalkedRegion& walked) const;

@@ -158,6 +158,38 @@ TEST_F(MWEntryFiles, AnOutputThatCannotBeWrittenFailsBeforeAnythingIsRead) {
     EXPECT_EQ(_host.asked("task_read_for_pid"), 0);
 }
 
+TEST_F(MWEntryFiles, NoFileIsBothReadAndWrittenOrWrittenTwice) {
+    std::ofstream(path("saved.heapsnap")) << "precious";
+    std::filesystem::create_directory(path("folder"));
+    std::filesystem::create_symlink("saved.heapsnap", path("link"));
+    _host.files = {path("saved.heapsnap")};
+    using Arguments = std::vector<std::string>;
+    const std::vector<std::pair<Arguments, std::string>> cases = {
+        {{path("saved.heapsnap"), "-j", path("link")}, path("link")},
+        {{path("saved.heapsnap"), "--statpack", path("folder/../saved.heapsnap")},
+         path("folder/../saved.heapsnap")},
+        {{"five", "-j", path("new"), "--statpack", path("new")}, path("new")},
+    };
+    for (const auto& [arguments, file] : cases) {
+        const auto refused = run(arguments);
+        EXPECT_EQ(refused.status, 1);
+        EXPECT_EQ(refused.errors, file + " would be both read and written, or written twice.\n");
+    }
+    EXPECT_EQ(contentOf(path("saved.heapsnap")), "precious");
+    EXPECT_TRUE(_host.unlinked.empty());
+    EXPECT_EQ(run({"five", "-j", "/dev/null", "--statpack", "/dev/null"}).status, 0);
+}
+
+TEST_F(MWEntryFiles, NamesAreEscapedOnATerminalAlone) {
+    _host.processes[5] = processOfFourPages("/bin/a\033[2Jb");
+    const auto document = [&] { return contentOf(path("a.json")); };
+    EXPECT_NE(run({"--pid", "5", "-j", path("a.json")}).output.find("a\033[2Jb [5]"), std::string::npos);
+    const std::string toFile = document();
+    _host.terminals = {STDOUT_FILENO};
+    EXPECT_NE(run({"--pid", "5", "-j", path("a.json")}).output.find("a\\033[2Jb [5]"), std::string::npos);
+    EXPECT_EQ(document(), toFile);
+}
+
 TEST_F(MWEntryFiles, OneMeasurementGoesToAllOutputs) {
     const auto report = run({"five", "-v", "-f", "bytes", "-j", path("a.json"), "--statpack", path("a.spj")});
     EXPECT_EQ(report.status, 0);

@@ -55,7 +55,7 @@ TEST_F(HeapsnapWriter, ARecordedProcessIsReadBackAsItWas) {
     (*read)->gatherData();
     const auto& regions = *(*read)->memoryRegions();
     ASSERT_EQ(regions.size(), 2U);
-    EXPECT_EQ(regions[0]->fullName(), "mapped file /lib/\uFFFDnot text");
+    EXPECT_EQ(regions[0]->fullName(), "mapped file /lib/\\xffnot text");
     EXPECT_EQ(regions[0]->dirtySize(), 16384U);
     EXPECT_EQ(regions[0]->swappedSize(), 16384U);
     EXPECT_EQ(regions[0]->reclaimableSize(), 16384U);
@@ -63,6 +63,15 @@ TEST_F(HeapsnapWriter, ARecordedProcessIsReadBackAsItWas) {
     EXPECT_EQ(regions[0]->offset(), 3U);
     EXPECT_EQ(regions[1]->fullName(), "__DATA /bin/victim");
     EXPECT_EQ(regions[1]->reclaimableSize(), 16384U) << "as the state of purging says";
+}
+
+TEST_F(HeapsnapWriter, AProcessThatEndsOnTheWayIsNoWholeOne) {
+    _host.processes[5] = {.executable = "/bin/victim", .walkFailure = MACH_SEND_INVALID_DEST};
+    const auto process = MWRecordedProcess::processWithPid(5);
+    _host.processes[5].gone = true;
+    process->record([](const HeapsnapRegion&) {});
+    EXPECT_EQ(process->errors().size(), 1U);
+    EXPECT_TRUE(process->warnings().empty());
 }
 
 }  // namespace

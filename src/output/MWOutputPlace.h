@@ -1,0 +1,33 @@
+#pragma once
+
+#include <optional>
+#include <string>
+
+/// Where an output file is to be: its folder, held open, and its name in there.
+///
+/// Symbolic links are followed, but for those that somebody else has put into a folder that everybody may
+/// write to: through them a measurement by root would overwrite what others choose.
+class MWOutputPlace {
+public:
+    /// None with errno; EACCES for a link that is not followed.
+    static std::optional<MWOutputPlace> find(const std::string& path);
+    ~MWOutputPlace();
+    MWOutputPlace(MWOutputPlace&& other) noexcept;
+    MWOutputPlace& operator=(MWOutputPlace&&) = delete;
+    MWOutputPlace(const MWOutputPlace&) = delete;
+    MWOutputPlace& operator=(const MWOutputPlace&) = delete;
+
+    int folder() const { return _folder; }
+    /// Never that of a link that still is to be followed, unless the kernel alone can follow it.
+    const std::string& name() const { return _name; }
+    /// Opens for writing, with these flags beside; negative with errno.
+    int open(int flags, unsigned mode) const;
+
+private:
+    MWOutputPlace(int folder, std::string name, bool isKernelLink)
+        : _folder(folder), _name(std::move(name)), _isKernelLink(isKernelLink) {}
+
+    int _folder;
+    std::string _name;
+    bool _isKernelLink;  ///< an open file under /proc, say of /dev/stdout
+};
