@@ -31,7 +31,7 @@ bool isUnchanged(const MWProcess& earlier, const MWProcess& now) {
     const auto* after = dynamic_cast<const MWUserProcess*>(&now);
     return before != nullptr && after != nullptr && before->phys_memweight() != 0 &&
            before->phys_memweight() == after->phys_memweight() && before->isSameProcess(*after) &&
-           before->hiddenFromDisplay() == after->hiddenFromDisplay();
+           before->canBeAnalyzedAgain() && before->hiddenFromDisplay() == after->hiddenFromDisplay();
 }
 
 /// Puts the unchanged ones in the place of the new ones: they are gathered already.
@@ -66,7 +66,7 @@ bool MWSampling::run() {
     }
     _lastFire = host.uptimeNanoseconds();
     _timer->arm({.firstAfter = 0, .interval = _interval, .leeway = _leeway});
-    const auto interrupt = MWMemweight::installCancelHandler([this] { _interrupt(); });
+    const auto interrupt = MWMemweight::installCancelHandler([this] { _stop("\nStopping...\n"); });
     fmt::fprintf(stderr, "Sampling at %.3gs interval... (<ctrl-c> to stop)\n", _args.sampleInterval());
     _done.acquire();
     std::fputs("Analyzing and writing output...\n", stderr);
@@ -142,17 +142,17 @@ void MWSampling::_print(MWMemweight& memweight) {
         memweight.addOutputFormatter(*formatter);
     }
     memweight.printOutputVerbose({.verbose = _args.spanlistLikeOutput(), .summarize = _args.summarize()});
+    errno = 0;
     if (std::fflush(stdout) != 0 || std::ferror(stdout) != 0) {
-        _stop();
+        // A reader that has seen enough is no failure.
+        if (errno != 0 && errno != EPIPE) {
+            std::perror("memweight: standard output");
+        }
+        _stop("");
     }
 }
 
-void MWSampling::_interrupt() {
-    std::fputs("\nStopping...\n", stderr);
-    _stop();
-}
-
-void MWSampling::_stop() {
+void MWSampling::_stop(const char* message) {
     const bool isFirst = !_isStopping.exchange(true);
     _timer->cancel();
     {
@@ -161,6 +161,7 @@ void MWSampling::_stop() {
             current->cancel();
         }
     }
+    std::fputs(message, stderr);
     _timerQueue.sync([] {});
     if (isFirst) {
         _done.release();

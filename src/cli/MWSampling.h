@@ -36,8 +36,8 @@ private:
     void _sample();
     MWTargetMap _resolveTargets();
     void _print(MWMemweight& memweight);
-    void _stop();
-    void _interrupt();
+    /// Once the gathering in progress is told to end, `message` goes to standard error.
+    void _stop(const char* message);
 
     MWMemweightArgs& _args;
     const Formatters& _formatters;

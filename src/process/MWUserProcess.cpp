@@ -3,6 +3,7 @@
 #include <fmt/core.h>
 #include <fmt/printf.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <system_error>
@@ -116,6 +117,8 @@ void MWUserProcess::gatherData() {
     }
     _gatherMemoryData();
     _images.reset();
+    _canBeAnalyzedAgain = std::ranges::none_of(
+        *memoryRegions(), [](const auto& region) { return region->subrangeList() != nullptr; });
 }
 
 void MWUserProcess::_processMachVMError(kern_return_t result, MWExpectedError expected) {

@@ -87,6 +87,9 @@ public:
     bool takesLongToGather() const override { return _physMemweight >= kLargeProcess; }
     /// Does nothing for a process that has its regions.
     void gatherData() override;
+    /// Whether the gathered regions can be joined once more: where other processes hold other pages of one,
+    /// the first joining uses up what tells them apart. Known once gathered.
+    bool canBeAnalyzedAgain() const { return _canBeAnalyzedAgain; }
     /// Whether `other` stands for the same process: a pid alone can have been given away.
     bool isSameProcess(const MWUserProcess& other) const {
         return pid() == other.pid() && _startTime == other._startTime;
@@ -228,5 +231,6 @@ private:
 
     static constexpr uint64_t kLargeProcess = uint64_t{256} << 20U;
     uint64_t _physMemweight = 0;
+    bool _canBeAnalyzedAgain = false;
     std::pair<uint64_t, uint64_t> _startTime;  ///< seconds and microseconds
 };

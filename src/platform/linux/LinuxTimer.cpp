@@ -53,6 +53,8 @@ LinuxTimer::~LinuxTimer() {
 void LinuxTimer::arm(const MWTimerSchedule& schedule) {
     const itimerspec times = {.it_interval = timespecOf(schedule.interval),
                               .it_value = timespecOf(std::max<uint64_t>(schedule.firstAfter, 1))};
+    // A fire of the schedule before that is counted later would pass for one of this.
+    const std::lock_guard lock(_mutex);
     _firing->fires = 0;
     timerfd_settime(_timer.get(), 0, &times, nullptr);
 }
@@ -69,12 +71,18 @@ void LinuxTimer::_wait() {
         if ((waits[0].revents & POLLIN) != 0) {
             return;
         }
-        uint64_t fires = 0;
-        if (read(_timer.get(), &fires, sizeof(fires)) == sizeof(fires)) {
-            _firing->fires += fires;
+        if (_countFires()) {
             _queueHandler();
         }
     }
+}
+
+bool LinuxTimer::_countFires() {
+    const std::lock_guard lock(_mutex);
+    uint64_t fires = 0;
+    const bool hasFired = read(_timer.get(), &fires, sizeof(fires)) == sizeof(fires);
+    _firing->fires += hasFired ? fires : 0;
+    return hasFired;
 }
 
 void LinuxTimer::_queueHandler() {

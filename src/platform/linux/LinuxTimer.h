@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <thread>
 
 #include "platform/MWTimer.h"
@@ -37,10 +38,13 @@ private:
 
     LinuxTimer(MWSerialQueue& queue, Handler handler);
     void _wait();
+    /// False when there are none to count.
+    bool _countFires();
     void _queueHandler();
 
     MWSerialQueue& _queue;
     std::shared_ptr<Firing> _firing;
+    std::mutex _mutex;  ///< held while the schedule changes and while fires are counted
     procfs::Descriptor _timer;
     procfs::Descriptor _ended;  ///< eventfd
     std::thread _thread;
