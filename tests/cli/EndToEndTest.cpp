@@ -273,14 +273,15 @@ TEST(EndToEnd, AGrowingProcessIsSampledUntilTheInterrupt) {
     const ChildProcess child(grow);
     const std::string path = testing::TempDir() + "memweight-" + std::to_string(getpid());
     // Each sample is in the file as soon as it is taken.
-    const std::string command = std::string(MEMWEIGHT_BINARY) + " --sample 0.05 --pid " +
-                                std::to_string(child.pid()) + " --statpack " + path + " > " + path +
-                                ".text 2>&1 & tool=$!; until [ $(grep -c gather_duration " + path +
-                                ") -ge 3 ]; do sleep 0.05; done; kill -INT $tool; wait $tool";
+    const std::string command =
+        std::string(MEMWEIGHT_BINARY) + " --sample 0.05 --pid " + std::to_string(child.pid()) +
+        " --statpack " + path + " > " + path + ".text 2>&1 & tool=$!; until [ $(cat " + path +
+        " 2>/dev/null | grep -c gather_duration) -ge 3 ]; do sleep 0.05; done; kill -INT $tool; wait $tool";
     EXPECT_EQ(std::system(command.c_str()), 0);
     const std::string text = contentsOf(path + ".text");
     EXPECT_NE(text.find("Sampling at 0.05s interval... (<ctrl-c> to stop)\n"), std::string::npos) << text;
-    EXPECT_TRUE(text.ends_with("\nStopping...\nAnalyzing and writing output...\n")) << text;
+    EXPECT_NE(text.find("\nStopping...\n"), std::string::npos) << text;
+    EXPECT_NE(text.find("Analyzing and writing output...\n"), std::string::npos) << text;
     std::ifstream file(path);
     std::vector<double> charges;
     for (std::string line; std::getline(file, line);) {
