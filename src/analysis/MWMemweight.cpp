@@ -88,7 +88,7 @@ void MWMemweight::analyzeData() {
     for (const auto& process : _processes) {
         _addProcess(*process);
     }
-    _objectCount = _objectMaps->objectCount();
+    _objectCount = _objectMaps->objects().size();
     finalizeObjects();
     _buildProcessToMemweightMap();
 }
@@ -106,7 +106,9 @@ void MWMemweight::_addProcess(const MWProcess& process) {
 }
 
 void MWMemweight::finalizeObjects() {
-    _objectMaps->forEachObject([](MWMemoryObject& object) { object.finalize(); });
+    for (const auto& object : _objectMaps->objects()) {
+        object->finalize();
+    }
 }
 
 MWProcessOrder MWMemweight::_notHiddenProcesses() const {
