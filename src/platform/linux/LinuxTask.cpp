@@ -266,7 +266,15 @@ kern_return_t LinuxTask::takeSnapshot() {
     if (owner.pid == _pid) {
         _checkFamilyMemory();
     }
+    mappings.forgetMany();
     return KERN_SUCCESS;
+}
+
+void LinuxTask::Mappings::forgetMany() {
+    constexpr size_t kMany = 4096;
+    if (texts.capacity() > kMany) {
+        *this = {};
+    }
 }
 
 // One generation is too few where a child rewrote memory and forked again: its frames are then joined with

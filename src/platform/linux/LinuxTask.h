@@ -128,6 +128,9 @@ private:
         std::vector<procfs::Vma> texts;
         std::vector<BackedVma> vmas;          ///< of `texts`
         std::optional<MappingCounts> counts;  ///< where smaps was not read
+
+        /// Gives the room of very many mappings back, which few processes need.
+        void forgetMany();
     };
     kern_return_t _readMappings(Mappings& mappings);
     bool _readMappingsOnce(Mappings& mappings);
