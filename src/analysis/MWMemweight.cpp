@@ -4,6 +4,7 @@
 #include <ranges>
 #include <utility>
 
+#include "platform/MWHeap.h"
 #include "platform/MWHostInterface.h"
 #include "platform/MWPhysMemweightSwitch.h"
 #include "process/MWUnresponsiveProcess.h"
@@ -37,14 +38,16 @@ MWProcessList MWMemweight::_longestFirst(MWProcessList processes) {
 }
 
 bool MWMemweight::gatherData() {
+    // Most have some dozens of regions.
+    constexpr size_t kKeptOfProcess = 20000;
     _gatherStartTime = MWTime::now();
     MWHostInterface::current().beginOwnedVmObjectSurvey();
     MWProcessList processes = _processesBySortingPidDesc(_processes);
-    processes = _takeStep(processes, [](MWProcess& process) { process.prepareToGatherData(); });
+    processes = _takeStep(processes, 0, [](MWProcess& process) { process.prepareToGatherData(); });
     // Those of an earlier measurement, which may still be printed, have what they need.
     std::erase_if(processes, [](const auto& process) { return process->memoryRegions().has_value(); });
-    processes =
-        _takeStep(_longestFirst(std::move(processes)), [](MWProcess& process) { process.gatherData(); });
+    processes = _takeStep(_longestFirst(std::move(processes)), kKeptOfProcess,
+                          [](MWProcess& process) { process.gatherData(); });
     if (_gathering->stoppedEarly && !processes.empty()) {
         _processesBySortingPidDesc(std::move(processes))
             .back()
@@ -56,8 +59,10 @@ bool MWMemweight::gatherData() {
 
 /// Answers those that took it. One that does not get any further is reported as an error: in its place comes
 /// another process object, because nobody but the thread that was given up may touch it any more.
-MWProcessList MWMemweight::_takeStep(const MWProcessList& processes, const GatheringStep& step) {
-    const MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
+MWProcessList MWMemweight::_takeStep(const MWProcessList& processes, size_t bytesKept,
+                                     const GatheringStep& step) {
+    MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
+    queue.setBytesKeptOfItem(bytesKept);
     const auto stuck = queue.apply(processes.size(), [processes, step, gathering = _gathering](size_t index) {
         if (gathering->earlyExit) {
             gathering->stoppedEarly = true;
@@ -84,6 +89,8 @@ void MWMemweight::analyzeData() {
     for (const auto& process : _processes) {
         regions += _regionsOf(*process).size();
     }
+    constexpr size_t kMadeOfRegion = 300;
+    MWExpectAllocations(regions * kMadeOfRegion);
     _objectMaps.emplace(_processes.size(), regions);
     for (const auto& process : _processes) {
         _addProcess(*process);

@@ -117,7 +117,8 @@ private:
     using GatheringStep = std::function<void(MWProcess&)>;
 
     static MWProcessList _longestFirst(MWProcessList processes);
-    MWProcessList _takeStep(const MWProcessList& processes, const GatheringStep& step);
+    /// `bytesKept` of each process, for the time being.
+    MWProcessList _takeStep(const MWProcessList& processes, size_t bytesKept, const GatheringStep& step);
 
     struct Messages {
         MWProcessOrder processesWithWarnings;

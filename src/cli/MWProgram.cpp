@@ -1,32 +1,16 @@
 #include "cli/MWProgram.h"
 
 #include <fcntl.h>
-#include <malloc.h>
 #include <unistd.h>
 
 #include <csignal>
 #include <cstdio>
 
+#include "platform/MWHeap.h"
 #include "platform/MWWorkQueue.h"
 
-namespace {
-
-// Much of what a process's gathering takes is free again when the next one begins. Given back to the kernel
-// in between, it would have to be cleared each time. What only a process of very many mappings needs is given
-// back, as the next thread's share of the memory is another one.
-void keepFreedMemory() {
-    constexpr int kMost = 32 << 20;
-    constexpr int kLarge = 2 << 20;
-    constexpr int kStep = 256 << 10;
-    mallopt(M_TRIM_THRESHOLD, kMost);
-    mallopt(M_MMAP_THRESHOLD, kLarge);
-    mallopt(M_TOP_PAD, kStep);
-}
-
-}  // namespace
-
 void MWPrepareProgram() {
-    keepFreedMemory();
+    MWPrepareHeap();
     // A file opened later must not take the place of a standard stream that the caller closed: what is told
     // would be written into it.
     int descriptor = 0;

@@ -27,10 +27,9 @@ GivenUpThreads& givenUpThreads() {
 
 std::vector<size_t> MWWatchedWork::run(std::function<void()> setUpThread) {
     _setUpThread = std::move(setUpThread);
-    const size_t processors = std::max(1U, std::thread::hardware_concurrency());
     {
         std::unique_lock lock(_mutex);
-        if (_addWorkers(std::min(_count, processors))) {
+        if (_addWorkers(threadsFor(_count))) {
             _watch(lock);
         }
     }
@@ -42,6 +41,10 @@ std::vector<size_t> MWWatchedWork::run(std::function<void()> setUpThread) {
     }
     std::ranges::sort(_givenUp);
     return std::move(_givenUp);
+}
+
+size_t MWWatchedWork::threadsFor(size_t count) {
+    return std::min<size_t>(count, std::max(1U, std::thread::hardware_concurrency()));
 }
 
 /// False when there is none now.

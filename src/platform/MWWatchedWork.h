@@ -20,6 +20,8 @@ public:
     /// To be called once; see MWConcurrentQueue::apply. Each thread calls `setUpThread` first.
     std::vector<size_t> run(std::function<void()> setUpThread);
 
+    /// How many threads so many items get.
+    static size_t threadsFor(size_t count);
     static bool hasGivenUp();
     static void awaitGivenUp();
 

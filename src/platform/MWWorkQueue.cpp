@@ -10,6 +10,7 @@
 #include <thread>
 #include <utility>
 
+#include "platform/MWHeap.h"
 #include "platform/MWSignalMask.h"
 #include "platform/MWWatchedWork.h"
 
@@ -38,9 +39,12 @@ MWConcurrentQueue::MWConcurrentQueue(std::string label, uint32_t qualityOfServic
     : _label(std::move(label)), _qualityOfService(qualityOfService) {}
 
 std::vector<size_t> MWConcurrentQueue::apply(size_t count, std::function<void(size_t)> work) const {
-    const auto setUpThread = [label = _label, qualityOfService = _qualityOfService] {
+    const size_t threads = MWWatchedWork::threadsFor(count);
+    const size_t bytesKept = threads == 0 ? 0 : count * _bytesKeptOfItem / threads;
+    const auto setUpThread = [label = _label, qualityOfService = _qualityOfService, bytesKept] {
         nameThread(label);
         applyQualityOfService(qualityOfService);
+        MWExpectAllocations(bytesKept);
     };
     return std::make_shared<MWWatchedWork>(count, std::move(work))->run(setUpThread);
 }

@@ -37,10 +37,13 @@ public:
     static void awaitGivenUp();
 
     const std::string& label() const { return _label; }
+    /// What an item leaves behind, in bytes: each thread makes room for its share at once (see MWHeap.h).
+    void setBytesKeptOfItem(size_t bytes) { _bytesKeptOfItem = bytes; }
 
 private:
     std::string _label;
     uint32_t _qualityOfService;
+    size_t _bytesKeptOfItem = 0;
 };
 
 /// A serial queue: work items run one after the other, in the order in which they were queued, on a thread of

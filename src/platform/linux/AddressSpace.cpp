@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "platform/MWHeap.h"
 #include "platform/MWRegionTags.h"
 
 namespace {
@@ -367,6 +368,7 @@ AddressSpace::AddressSpace(const std::vector<BackedVma>& backed, const AddressSp
     LinuxImages images = imagesOfVmas(backed);
     const std::vector<uint32_t> tags = tagsForVmas(backed, images, context.names);
     _regions.reserve(backed.size());
+    MWUseLargePages(_regions.data(), backed.size() * sizeof(AddressSpaceRegion));
     RegionBuilder builder(owner, pages, context, _regions);
     for (size_t index = 0; index < backed.size(); ++index) {
         const size_t image = images.imageOfVma[index];

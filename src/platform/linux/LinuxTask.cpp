@@ -10,6 +10,7 @@
 #include <unordered_set>
 #include <utility>
 
+#include "platform/MWHeap.h"
 #include "platform/linux/SmapsParser.h"
 
 namespace {
@@ -267,6 +268,9 @@ kern_return_t LinuxTask::takeSnapshot() {
         _checkFamilyMemory();
     }
     mappings.forgetMany();
+    // Whoever walks the regions keeps something of each.
+    constexpr size_t kKeptOfRegion = 200;
+    MWExpectAllocations(_space->regions().size() * kKeptOfRegion);
     return KERN_SUCCESS;
 }
 

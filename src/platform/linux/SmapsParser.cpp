@@ -6,6 +6,7 @@
 #include <memory>
 #include <utility>
 
+#include "platform/MWHeap.h"
 #include "platform/linux/ProcText.h"
 #include "platform/linux/Procfs.h"
 
@@ -153,7 +154,19 @@ void SmapsParser::_parseLine(std::string_view line) {
 }
 
 // Sizes of a mapping that could not be read must not land on the one before it.
+// Room that is not touched costs nothing, other than to move everything into a larger one again and again. It
+// is made at once for as many as the kernel allows a process unless told otherwise.
+void SmapsParser::_makeRoomForMany() {
+    constexpr size_t kMany = 4096;
+    constexpr size_t kUsualLimit = 65536;
+    if (_vmas.size() == kMany) {
+        _vmas.reserve(kUsualLimit);
+        MWUseLargePages(_vmas.data(), kUsualLimit * sizeof(Vma));
+    }
+}
+
 void SmapsParser::_parseHeader(std::string_view line) {
+    _makeRoomForMany();
     const uint64_t lowest = _vmas.empty() ? 0 : _vmas.back().end;
     Vma& vma = _vmas.emplace_back();
     _inMapping = parseMapping(line, vma) && vma.start >= lowest;

@@ -79,6 +79,7 @@ public:
 private:
     void _parseLine(std::string_view line);
     void _parseHeader(std::string_view line);
+    void _makeRoomForMany();
     void _parseField(std::string_view line);
 
     std::vector<Vma> _vmas;
