@@ -33,6 +33,16 @@ void ForkCensus::begin() {
     _complete = false;
 }
 
+void ForkCensus::addKernelThread(int32_t pid) {
+    const std::lock_guard lock(_mutex);
+    _kernelThreads.insert(pid);
+}
+
+void ForkCensus::forgetKernelThreads() {
+    const std::lock_guard lock(_mutex);
+    _kernelThreads.clear();
+}
+
 void ForkCensus::add(int32_t pid, uint64_t program) {
     const std::lock_guard lock(_mutex);
     ++_measured;
@@ -54,7 +64,8 @@ void ForkCensus::_addOthers() {
     procfs::forEachEntry(_proc, ".", [&](int directory, const char* name) {
         std::string_view number = name;
         int32_t pid = 0;
-        if (procfs::takeNumber(number, pid) && number.empty() && !_programs.contains(pid)) {
+        if (procfs::takeNumber(number, pid) && number.empty() && !_programs.contains(pid) &&
+            !_kernelThreads.contains(pid)) {
             const procfs::Descriptor process = procfs::open(directory, name, O_PATH | O_DIRECTORY);
             const std::string auxv = process ? auxiliaryVectorOf(process.get()) : "";
             _add(pid, auxv.empty() ? 0 : _identity.bytes(auxv));

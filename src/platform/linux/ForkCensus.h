@@ -3,6 +3,7 @@
 #include <cstdint>
 #include <mutex>
 #include <unordered_map>
+#include <unordered_set>
 
 #include "platform/linux/ObjectIdentity.h"
 
@@ -19,6 +20,10 @@ public:
     ForkCensus(int proc, const ObjectIdentity& identity) : _proc(proc), _identity(identity) {}
 
     void begin();
+    /// A process without memory of its own that there will be until the next listing: nobody's fork.
+    void addKernelThread(int32_t pid);
+    /// The system's processes are listed anew.
+    void forgetKernelThreads();
     /// A process that is measured; `program` stands for its auxiliary vector, 0 where that is not known.
     void add(int32_t pid, uint64_t program);
     /// How many were added.
@@ -35,6 +40,7 @@ private:
     mutable std::mutex _mutex;                        ///< guards what follows
     std::unordered_map<int32_t, uint64_t> _programs;  ///< by pid
     std::unordered_map<uint64_t, size_t> _members;    ///< by program
+    std::unordered_set<int32_t> _kernelThreads;
     size_t _measured = 0;
     bool _complete = false;
 };

@@ -93,6 +93,7 @@ LinuxTask* MWLinuxHost::_task(task_t task) {
 void MWLinuxHost::_forgetListed() {
     const std::lock_guard lock(_listedMutex);
     _listed.clear();
+    _listedPids.clear();
 }
 
 std::optional<ListedProcess> MWLinuxHost::_takeListed(int32_t pid) {

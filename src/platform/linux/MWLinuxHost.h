@@ -127,6 +127,7 @@ private:
 
     std::mutex _listedMutex;  ///< guards what follows
     std::map<int32_t, ListedProcess> _listed;
+    std::vector<int32_t> _listedPids;  ///< whose number was told and which are to be told next
 
     std::mutex _tasksMutex;  ///< guards the table; a task itself is one thread's at a time
     std::map<task_t, std::unique_ptr<LinuxTask>> _tasks;

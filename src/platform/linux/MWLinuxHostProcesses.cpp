@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <utility>
 
 #include "platform/linux/MWLinuxHost.h"
 
@@ -136,13 +137,20 @@ std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
 }
 
 int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
-    _forgetListed();
-    const std::vector<int32_t> entries = numericEntries(_run.proc.get());
+    if (pids.empty()) {
+        _forgetListed();
+        _run.forkCensus.forgetKernelThreads();
+    }
+    // Whoever asks for the number asks for the pids next.
+    const std::lock_guard lock(_listedMutex);
+    const std::vector<int32_t> entries =
+        _listedPids.empty() ? numericEntries(_run.proc.get()) : std::exchange(_listedPids, {});
     if (entries.empty()) {
         return -1;
     }
     makeRoomForDescriptors(entries.size());
     if (pids.empty()) {
+        _listedPids = entries;
         return static_cast<int>(entries.size() + 1);
     }
     pids[0] = 0;
@@ -175,6 +183,9 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     std::string text;
     const auto stat = directory >= 0 && procfs::readRecord(directory, "stat", text) ? procfs::parseStat(text)
                                                                                     : std::nullopt;
+    if (stat && stat->isKernelThread()) {
+        _run.forkCensus.addKernelThread(pid);
+    }
     if (!stat || stat->isKernelThread()) {
         return noSuchProcess();
     }
