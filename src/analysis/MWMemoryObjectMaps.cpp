@@ -49,10 +49,11 @@ MWMemoryObject*& MWMemoryObjectMap::operator[](uint64_t key) {
 
 /// The one that has the key, or the free one for it.
 MWMemoryObjectMap::Slot& MWMemoryObjectMap::_slotOfKey(uint64_t key) {
-    // Keys are identifiers and addresses, whose low bits say little: the product's high bits depend on all.
+    // The low bits of identifiers and addresses say little; the high bits of the product depend on all others.
     constexpr uint64_t kGoldenRatio = 0x9E3779B97F4A7C15;
+    const uint64_t hash = key >> 8U;
     const size_t mask = _slots.size() - 1;
-    size_t place = static_cast<size_t>((key * kGoldenRatio) >> 32U) & mask;
+    size_t place = static_cast<size_t>((hash * kGoldenRatio) >> 32U) & mask;
     while (_slots[place].key != 0 && _slots[place].key != key) {
         place = (place + 1) & mask;
     }

@@ -269,7 +269,8 @@ private:
                       .mzi_cur_size = bytes,
                       .mzi_elem_size = cache.objectSize,
                       .mzi_alloc_size = slabSize,
-                      .mzi_collectable = isReclaimable(_sources.sysDirectory, cache.name) ? 1U : 0U});
+                      .mzi_collectable =
+                          bytes != 0 && isReclaimable(_sources.sysDirectory, cache.name) ? 1U : 0U});
         }
         _addZone("kmalloc-large", {.mzi_cur_size = MWSaturatingSubtract(_meminfo["Slab"], sum)});
     }
