@@ -35,15 +35,13 @@ void nameThread(const std::string& label) {
 
 }  // namespace
 
-MWConcurrentQueue::MWConcurrentQueue(std::string label, uint32_t qualityOfService)
-    : _label(std::move(label)), _qualityOfService(qualityOfService) {}
+MWConcurrentQueue::MWConcurrentQueue(std::string label, uint32_t) : _label(std::move(label)) {}
 
 std::vector<size_t> MWConcurrentQueue::apply(size_t count, std::function<void(size_t)> work) const {
     const size_t threads = MWWatchedWork::threadsFor(count);
     const size_t bytesKept = threads == 0 ? 0 : count * _bytesKeptOfItem / threads;
-    const auto setUpThread = [label = _label, qualityOfService = _qualityOfService, bytesKept] {
+    const auto setUpThread = [label = _label, bytesKept] {
         nameThread(label);
-        applyQualityOfService(qualityOfService);
         MWExpectAllocations(bytesKept);
     };
     return std::make_shared<MWWatchedWork>(count, std::move(work))->run(setUpThread);

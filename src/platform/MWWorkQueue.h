@@ -10,8 +10,10 @@
 #include <thread>
 #include <vector>
 
-/// Scheduling classes for work: the values are fixed by the design, the effect is a nice value of the
-/// queue's threads (interactive work is not slowed by a measurement in the background).
+/// Scheduling classes for work: the values are fixed by the design. The effect is a nice value of the threads
+/// of serial queues, so that interactive work is not slowed by what is written in the background. Those of
+/// concurrent queues have none: while one of them waits for a processor, the kernel can be holding the memory
+/// map of a measured process for it, and makes that process wait as well.
 inline constexpr uint32_t QOS_CLASS_UTILITY = 17;
 inline constexpr uint32_t QOS_CLASS_USER_INITIATED = 25;
 
@@ -42,7 +44,6 @@ public:
 
 private:
     std::string _label;
-    uint32_t _qualityOfService;
     size_t _bytesKeptOfItem = 0;
 };
 
