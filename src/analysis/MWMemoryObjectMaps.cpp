@@ -49,7 +49,8 @@ MWMemoryObject*& MWMemoryObjectMap::operator[](uint64_t key) {
 
 /// The one that has the key, or the free one for it.
 MWMemoryObjectMap::Slot& MWMemoryObjectMap::_slotOfKey(uint64_t key) {
-    // The low bits of identifiers and addresses say little; the high bits of the product depend on all others.
+    // The low bits of identifiers and addresses say little; the high bits of the product depend on all
+    // others.
     constexpr uint64_t kGoldenRatio = 0x9E3779B97F4A7C15;
     const uint64_t hash = key >> 8U;
     const size_t mask = _slots.size() - 1;

@@ -1,6 +1,8 @@
 #include "analysis/MWMemweight.h"
 
 #include <algorithm>
+#include <map>
+#include <mutex>
 #include <ranges>
 #include <utility>
 
@@ -8,6 +10,29 @@
 #include "platform/MWHostInterface.h"
 #include "platform/MWPhysMemweightSwitch.h"
 #include "process/MWUnresponsiveProcess.h"
+
+namespace {
+
+/// The processes that threads of earlier measurements still wait for, so that a run of many samples loses
+/// neither ten seconds nor a thread to one of them again and again.
+class StuckProcesses {
+public:
+    static void add(const std::shared_ptr<MWProcess>& process) {
+        const std::lock_guard lock(_mutex);
+        _processes[process->asNumber()] = process;
+    }
+    static bool contain(const MWProcess& process) {
+        const std::lock_guard lock(_mutex);
+        const auto found = _processes.find(process.asNumber());
+        return found != _processes.end() && !found->second.expired();
+    }
+
+private:
+    inline static std::mutex _mutex;  ///< guards what follows
+    inline static std::map<int64_t, std::weak_ptr<MWProcess>> _processes;
+};
+
+}  // namespace
 
 MWMemweight::MWMemweight(MWProcessList processes) : _processes(std::move(processes)) {}
 
@@ -43,6 +68,13 @@ bool MWMemweight::gatherData() {
     _gatherStartTime = MWTime::now();
     MWHostInterface::current().beginOwnedVmObjectSurvey();
     MWProcessList processes = _processesBySortingPidDesc(_processes);
+    std::erase_if(processes, [this](const std::shared_ptr<MWProcess>& process) {
+        const bool isStuck = StuckProcesses::contain(*process);
+        if (isStuck) {
+            _replaceUnresponsive(process);
+        }
+        return isStuck;
+    });
     processes = _takeStep(processes, 0, [](MWProcess& process) { process.prepareToGatherData(); });
     // Those of an earlier measurement, which may still be printed, have what they need.
     std::erase_if(processes, [](const auto& process) { return process->memoryRegions().has_value(); });
@@ -63,24 +95,30 @@ MWProcessList MWMemweight::_takeStep(const MWProcessList& processes, size_t byte
                                      const GatheringStep& step) {
     MWConcurrentQueue queue("org.memweight.memweight.gatherdata", _qualityOfService);
     queue.setBytesKeptOfItem(bytesKept);
-    const auto stuck = queue.apply(processes.size(), [processes, step, gathering = _gathering](size_t index) {
+    const auto items = std::make_shared<MWProcessList>(processes);
+    const auto stuck = queue.apply(items->size(), [items, step, gathering = _gathering](size_t index) {
         if (gathering->earlyExit) {
             gathering->stoppedEarly = true;
         } else {
-            step(*processes[index]);
+            step(*(*items)[index]);
         }
     });
     MWProcessList remaining;
     for (size_t index = 0; index < processes.size(); ++index) {
         if (!std::ranges::binary_search(stuck, index)) {
             remaining.push_back(processes[index]);
+            (*items)[index].reset();  // a thread that was given up keeps its own process alone
             continue;
         }
-        std::ranges::replace(
-            _processes, processes[index],
-            std::shared_ptr<MWProcess>(std::make_shared<MWUnresponsiveProcess>(*processes[index])));
+        StuckProcesses::add(processes[index]);
+        _replaceUnresponsive(processes[index]);
     }
     return remaining;
+}
+
+void MWMemweight::_replaceUnresponsive(const std::shared_ptr<MWProcess>& stuck) {
+    std::ranges::replace(_processes, stuck,
+                         std::shared_ptr<MWProcess>(std::make_shared<MWUnresponsiveProcess>(*stuck)));
 }
 
 void MWMemweight::analyzeData() {

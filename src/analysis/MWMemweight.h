@@ -118,6 +118,7 @@ private:
 
     static MWProcessList _longestFirst(MWProcessList processes);
     /// `bytesKept` of each process, for the time being.
+    void _replaceUnresponsive(const std::shared_ptr<MWProcess>& stuck);
     MWProcessList _takeStep(const MWProcessList& processes, size_t bytesKept, const GatheringStep& step);
 
     struct Messages {

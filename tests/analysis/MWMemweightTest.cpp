@@ -6,6 +6,7 @@
 
 #include "support/FakeHost.h"
 #include "support/FakeProcessSource.h"
+#include "support/FaultyHost.h"
 #include "support/RecordingFormatter.h"
 
 namespace {
@@ -40,6 +41,29 @@ std::string groupsOf(const MWProcessToProcessGroups& groups, int32_t pid) {
 }
 
 }  // namespace
+
+TEST(MWMemweight, DoesNotAskAgainWhileAThreadStillWaits) {
+    FakeHost inner;
+    inner.processes[7] = {.comm = "stuck"};
+    inner.processes[8] = {.comm = "other"};
+    FaultyHost host(inner, HostFault{{"mach_vm_region_recurse", 7, 1}, FaultKind::hangs});
+    const auto measure = [] {
+        auto memweight = std::make_unique<MWMemweight>(
+            MWProcessList{MWProcess::processWithPid(7), MWProcess::processWithPid(8)});
+        EXPECT_FALSE(memweight->gatherData());
+        memweight->analyzeData();
+        return memweight;
+    };
+    const std::vector<std::string> notResponding = {"stuck [7]: not responding"};
+    EXPECT_EQ(measure()->processes()[0]->errors(), notResponding);
+    const uint64_t waited = host.uptimeNanoseconds();
+    EXPECT_GE(waited, MWConcurrentQueue::patience);
+    EXPECT_EQ(measure()->processes()[0]->errors(), notResponding);
+    EXPECT_LT(host.uptimeNanoseconds(), waited + MWConcurrentQueue::patience);
+    EXPECT_EQ(inner.asked("mach_vm_region_recurse"), 2) << "the other one, twice";
+    host.release();
+    EXPECT_TRUE(measure()->processes()[0]->errors().empty()) << "it has answered";
+}
 
 TEST(MWMemweight, GathersUnlessCancelled) {
     const FakeHost host;
