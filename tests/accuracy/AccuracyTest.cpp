@@ -159,9 +159,11 @@ TEST_F(Accuracy, AlternatingPagesMakeFewRegions) {
     const pid_t pid = family.pid("root");
     const Measurement measurement = measure(family.pids());
     const AddressRange mapping = largestMapping(pid);
-    const auto& starts = measurement.regionStarts.at(pid);
-    EXPECT_LE(std::count_if(starts.begin(), starts.end(),
-                            [&](uint64_t start) { return start >= mapping.start && start < mapping.end; }),
+    const auto& regions = measurement.regions.at(pid);
+    EXPECT_LE(std::ranges::count_if(regions,
+                                    [&](const Measurement::Region& region) {
+                                        return region.start >= mapping.start && region.start < mapping.end;
+                                    }),
               1024);
     expectTrueSums("alternating pages", family.pids());
 }

@@ -1,16 +1,17 @@
 #include "accuracy/Measurement.h"
 
+#include <fmt/format.h>
 #include <sys/mman.h>
 
 #include <algorithm>
 #include <memory>
+#include <mutex>
 #include <span>
 #include <stdexcept>
 
 #include "accuracy/Workload.h"
 #include "analysis/MWMemweight.h"
 #include "analysis/MWProcessGroup.h"
-#include "platform/linux/MWLinuxHost.h"
 #include "support/ChildProcess.h"
 
 namespace {
@@ -57,18 +58,58 @@ private:
     pid_t _process = -1;
 };
 
+/// A live host that notes whose regions have protections which only smaps tells: a program's text, for one,
+/// may be written to, but is not.
+class WatchedHost : public MWLinuxHost {
+public:
+    explicit WatchedHost(MappingSource source) : MWLinuxHost("/proc", "/sys", source) {}
+
+    kern_return_t task_read_for_pid(int32_t pid, task_t& task) override {
+        const kern_return_t code = MWLinuxHost::task_read_for_pid(pid, task);
+        const std::lock_guard lock(_mutex);
+        _pids[task] = pid;
+        return code;
+    }
+    kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
+                                         vm_region_submap_info_64& info, uint32_t& count) override {
+        const auto code = MWLinuxHost::mach_vm_region_recurse(task, address, size, depth, info, count);
+        if (code == KERN_SUCCESS && info.max_protection != info.protection) {
+            const std::lock_guard lock(_mutex);
+            _readFromSmaps.insert(_pids.at(task));
+        }
+        return code;
+    }
+    std::set<pid_t> readFromSmaps() const { return _readFromSmaps; }
+
+private:
+    std::mutex _mutex;  ///< guards what follows while there is a measurement
+    std::map<task_t, pid_t> _pids;
+    std::set<pid_t> _readFromSmaps;
+};
+
 /// A live host that is the current one, in the mode that the tests measure in.
 class MeasuringHost {
 public:
-    MeasuringHost() { MWMemweight::setBreakDownPhysMemweight(true); }
+    explicit MeasuringHost(MappingSource source = MappingSource::cheapest) : _host(source) {
+        MWMemweight::setBreakDownPhysMemweight(true);
+    }
     ~MeasuringHost() { MWHostInterface::setCurrent(_previous); }
     MeasuringHost(const MeasuringHost&) = delete;
     MeasuringHost& operator=(const MeasuringHost&) = delete;
 
+    std::set<pid_t> readFromSmaps() const { return _host.readFromSmaps(); }
+
 private:
-    MWLinuxHost _host;
+    WatchedHost _host;
     MWHostInterface* _previous = MWHostInterface::setCurrent(&_host);
 };
+
+std::string textOf(const MWMemoryRegion& region) {
+    const MWCategoryTotals totals = region.totals();
+    return fmt::format("{} {} at {} mode {}: dirty {} swapped {} clean {} reclaimable {} wired {}",
+                       region.size(), region.fullName(), region.offset(), region.share_mode(), totals.dirty,
+                       totals.swapped, totals.clean, totals.reclaimable, totals.wired);
+}
 
 Measurement measureProcesses(MWProcessList processes) {
     Measurement measurement;
@@ -82,7 +123,7 @@ Measurement measureProcesses(MWProcessList processes) {
     measurement.duration = std::chrono::steady_clock::now() - begin;
     for (const auto& process : memweight.processes()) {
         for (const auto& region : process->memoryRegions().value_or(MWMemoryRegionList())) {
-            measurement.regionStarts[process->pid()].push_back(region->start());
+            measurement.regions[process->pid()].push_back({region->start(), textOf(*region)});
         }
     }
     return measurement;
@@ -90,8 +131,8 @@ Measurement measureProcesses(MWProcessList processes) {
 
 }  // namespace
 
-Measurement measure(const std::vector<pid_t>& pids) {
-    const MeasuringHost host;
+Measurement measure(const std::vector<pid_t>& pids, MappingSource source) {
+    const MeasuringHost host(source);
     MWProcessList processes;
     for (const pid_t pid : pids) {
         processes.push_back(MWProcess::processWithPid(pid));
@@ -99,7 +140,9 @@ Measurement measure(const std::vector<pid_t>& pids) {
             throw std::runtime_error("cannot look at process " + std::to_string(pid));
         }
     }
-    return measureProcesses(std::move(processes));
+    Measurement measurement = measureProcesses(std::move(processes));
+    measurement.readFromSmaps = host.readFromSmaps();
+    return measurement;
 }
 
 Measurement measureAll() {

@@ -2,8 +2,6 @@
 // README. "memweight_bench MEMWEIGHT [--scale]", as root. Ends with status 1 when a bound is missed.
 
 #include <fcntl.h>
-#include <sched.h>
-#include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -18,10 +16,12 @@
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <sstream>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
 #include "bench/Population.h"
+#include "support/LazilyFreed.h"
 
 namespace {
 
@@ -337,34 +337,16 @@ private:
     Table _table;
 };
 
-/// The value of a line of /proc/vmstat.
-size_t lazilyFreedPages(const std::string& vmstat) {
-    const size_t at = vmstat.find("\npglazyfree ");
-    return at == std::string::npos ? 0 : std::strtoull(vmstat.c_str() + at + 12, nullptr, 10);
-}
-
-// Once any process has lazily freed memory, a page of this kind can be anywhere, and smaps is read for
-// everything until the machine is started again. That is a bench of its own (--as-is); this one is about a
-// machine where none has, so the count is covered up for the commands that it runs.
-void coverLazilyFreed() {
-    std::ifstream file("/proc/vmstat");
-    std::string text((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
-    const size_t pages = lazilyFreedPages(text);
-    if (pages == 0) {
-        return;
-    }
-    std::printf("%zu pages have been freed lazily since this machine was started: measured as if none had\n",
+// What a machine is like where somebody has lazily freed memory is a bench of its own (--as-is).
+void measureAsIfNobodyFreedLazily() {
+    try {
+        if (const size_t pages = coverLazilyFreed(); pages != 0) {
+            std::printf(
+                "%zu pages have been freed lazily since this machine was started: measured as if none had\n",
                 pages);
-    const size_t at = text.find("\npglazyfree ") + 12;
-    text.replace(at, text.find('\n', at) - at, "0");
-    const std::string cover = "/run/memweight-bench." + std::to_string(getpid()) + ".vmstat";
-    std::ofstream(cover) << text;
-    const bool covered = unshare(CLONE_NEWNS) == 0 &&
-                         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
-                         mount(cover.c_str(), "/proc/vmstat", nullptr, MS_BIND, nullptr) == 0;
-    unlink(cover.c_str());
-    if (!covered) {
-        fail("cannot cover /proc/vmstat");
+        }
+    } catch (const std::runtime_error& error) {
+        fail(error.what());
     }
 }
 
@@ -383,7 +365,7 @@ int main(int argc, char* argv[]) {
     };
     sync();  // pages of a program that was just built are dirty
     if (!has("--as-is")) {
-        coverLazilyFreed();
+        measureAsIfNobodyFreedLazily();
     }
     Bench bench(argv[1]);
     if (has("--scale")) {

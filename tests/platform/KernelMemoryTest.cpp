@@ -47,6 +47,9 @@ protected:
 
     Answer ask() {
         MWLinuxHost host(_top, _top + "/sysfs");
+        return ask(host);
+    }
+    Answer ask(MWLinuxHost& host) {
         MWKernelMemoryArrays arrays;
         Answer answer;
         answer.result = host.mach_memory_info(arrays);
@@ -480,6 +483,25 @@ TEST_F(KernelTexts, DamagedTextsMakeNoMemory) {
         EXPECT_FALSE(answer.sites.contains(tagSite(MWKernelTagPageMap)) &&
                      answer.sites.at(tagSite(MWKernelTagPageMap)).bytes > 100000 * kKiB);
     }
+}
+
+// Or what a process gave back meanwhile would be the kernel's, beside the charge of the process.
+TEST_F(KernelTexts, PageTablesOfAMeasuredProcessAreThoseOfItsCharge) {
+    writeMeminfo();
+    writeProcesses();
+    write("1/stat", "1 (init) S 0 1 1 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 500 0 0 0 1 2 3 0 0\n");
+    write("1/maps", "");
+    MWLinuxHost host(_top, _top + "/sysfs");
+    const auto hidden = [&] { return ask(host).sites.at(tagSite(MWKernelTagPageTables)).hidden; };
+    task_t task = 0;
+    ASSERT_EQ(host.task_read_for_pid(1, task), KERN_SUCCESS);
+    rusage_info_v5 usage;
+    ASSERT_EQ(host.proc_pid_rusage(1, usage), 0);
+    EXPECT_EQ(usage.ri_phys_memweight, 1000 * kKiB);
+    write("1/status", "Name:\tinit\nVmPTE:\t 400 kB\n");
+    EXPECT_EQ(hidden(), 1500 * kKiB);
+    host.task_release(task);
+    EXPECT_EQ(hidden(), 900 * kKiB) << "its pid may be another's";
 }
 
 TEST_F(KernelTexts, AnyBytesAreSymbols) {

@@ -116,7 +116,7 @@ bool countStretch(const Stretch& stretch, const PageScanner& scan, PageCounter& 
                                 .told = stretch.ofObjects ? told | kIsFileOrShared : told,
                                 .mostPages = kMostPagesAtOnce},
                                ranges, walkEnd);
-        if (count < 0 || walkEnd <= start) {
+        if (count < 0 || static_cast<size_t>(count) > ranges.size() || walkEnd <= start) {
             return false;
         }
         for (const ScannedRange& range : std::span(ranges).first(static_cast<size_t>(count))) {

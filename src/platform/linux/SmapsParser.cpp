@@ -153,7 +153,6 @@ void SmapsParser::_parseLine(std::string_view line) {
     }
 }
 
-// Sizes of a mapping that could not be read must not land on the one before it.
 // Room that is not touched costs nothing, other than to move everything into a larger one again and again. It
 // is made at once for as many as the kernel allows a process unless told otherwise.
 void SmapsParser::_makeRoomForMany() {
@@ -165,6 +164,7 @@ void SmapsParser::_makeRoomForMany() {
     }
 }
 
+// Sizes of a mapping that could not be read must not land on the one before it.
 void SmapsParser::_parseHeader(std::string_view line) {
     _makeRoomForMany();
     const uint64_t lowest = _vmas.empty() ? 0 : _vmas.back().end;

@@ -220,16 +220,21 @@ void pageKinds(const Arguments& arguments) {
     readPages(map(size), size);  // the zero page
 }
 
-// FILE PROCESSES: each maps all of the file privately, reads it and writes a tenth.
+// FILE PROCESSES: each maps all of the file privately, reads it and writes a tenth; with no processes this
+// one does.
 void privateFile(const Arguments& arguments) {
     const int file = open(arguments.text(0), O_RDONLY | O_CLOEXEC);
     const auto size = static_cast<size_t>(lseek(file, 0, SEEK_END));
+    const auto mapAndWrite = [=](size_t process) {
+        char* memory = map(size, {.flags = MAP_PRIVATE, .file = file});
+        readPages(memory, size);
+        touch(memory + process * (size / 10 / kPage * kPage), size / 10);
+    };
     for (size_t process = 0; process < arguments.count(1); ++process) {
-        spawn(numbered("process", process), [=] {
-            char* memory = map(size, {.flags = MAP_PRIVATE, .file = file});
-            readPages(memory, size);
-            touch(memory + process * (size / 10 / kPage * kPage), size / 10);
-        });
+        spawn(numbered("process", process), [=] { mapAndWrite(process); });
+    }
+    if (arguments.count(1) == 0) {
+        mapAndWrite(1);
     }
 }
 

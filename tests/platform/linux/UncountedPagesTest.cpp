@@ -1,0 +1,128 @@
+#include "platform/linux/UncountedPages.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <array>
+#include <optional>
+#include <string>
+
+#include "platform/linux/Cachestat.h"
+#include "support/RecordedTree.h"
+
+namespace {
+
+class UncountedPagesTest : public RecordedTree {
+protected:
+    bool canBeInAnonymousMemory() {
+        const procfs::Descriptor proc = directory("");
+        return UncountedPages(proc.get(), _top + "/pages_shared").canBeInAnonymousMemory();
+    }
+    bool hasCleanPages(const std::string& path) {
+        const auto file = procfs::open(AT_FDCWD, (_top + "/" + path).c_str());
+        fsync(file.get());
+        const auto pages = readCachestat(file.get());
+        return pages && pages->cached != 0 && pages->dirty + pages->writeback == 0;
+    }
+};
+
+procfs::Vma mappingOf(uint64_t start, uint64_t inode, uint32_t deviceMajor = 8) {
+    procfs::Vma vma;
+    vma.start = start;
+    vma.end = start + 0x1000;
+    vma.inode = inode;
+    vma.deviceMajor = deviceMajor;
+    return vma;
+}
+
+// What cannot be understood can mean anything, so smaps is read.
+TEST_F(UncountedPagesTest, OnlyPlainZerosSayThatThereAreNone) {
+    struct Row {
+        std::optional<const char*> vmstat;
+        std::optional<const char*> merged;
+        bool canBe;
+    };
+    for (const Row& row : {
+             Row{"nr_free_pages 5\npglazyfree 0\npglazyfreed 9\n", {}, false},
+             Row{"pglazyfreed 9\npglazyfree 0", "0\n", false},
+             Row{"nr_free_pages 0\npglazyfree 18432\npglazyfreed 0\n", {}, true},
+             Row{{}, {}, true},
+             Row{"", {}, true},
+             Row{"pglazyfreed 0\nxpglazyfree 0\n", {}, true},
+             Row{"pglazyfree\n0\n", {}, true},
+             Row{"pglazyfree \n", {}, true},
+             Row{"pglazyfree -1\n", {}, true},
+             Row{"pglazyfree 99999999999999999999999\n", {}, true},
+             Row{"pglazyfree 0\n", "7\n", true},
+             Row{"pglazyfree 0\n", "", true},
+             Row{"pglazyfree 0\n", "none\n", true},
+         }) {
+        for (const auto& [name, text] : {std::pair("vmstat", row.vmstat), {"pages_shared", row.merged}}) {
+            std::filesystem::remove(_top + "/" + name);
+            if (text) {
+                write(name, *text);
+            }
+        }
+        EXPECT_EQ(canBeInAnonymousMemory(), row.canBe)
+            << row.vmstat.value_or("no vmstat") << " " << row.merged.value_or("");
+    }
+}
+
+TEST_F(UncountedPagesTest, WhatWasFoundHoldsForOneMeasurement) {
+    write("vmstat", "pglazyfree 0\n");
+    write("self/mountinfo", "");
+    const procfs::Descriptor proc = directory("");
+    UncountedPages pages(proc.get(), _top + "/pages_shared");
+    EXPECT_FALSE(pages.canBeInAnonymousMemory());
+    write("vmstat", "pglazyfree 1\n");
+    EXPECT_FALSE(pages.canBeInAnonymousMemory());
+    pages.begin();
+    EXPECT_TRUE(pages.canBeInAnonymousMemory());
+}
+
+TEST_F(UncountedPagesTest, AFileIsCleanWhereNoPageOfItIsDirty) {
+    write("self/mountinfo",
+          "24 1 8:0 / / rw - ext4 /dev/sda rw\n25 24 9:0 / /srv rw - nfs server:/srv rw\n"
+          "26 24 10:0 / /x rw - ext4\n");
+    write("20/map_files/1000-2000", "clean");
+    write("20/map_files/2000-3000", "another");
+    if (!hasCleanPages("20/map_files/1000-2000")) {
+        GTEST_SKIP() << "the kernel does not tell of a file's pages here whether they are clean";
+    }
+    const procfs::Descriptor proc = directory("");
+    const procfs::Descriptor process = directory("20");
+    const int memory = process.get();
+    UncountedPages pages(proc.get());
+    EXPECT_TRUE(pages.isCleanFile(memory, mappingOf(0x1000, 1)));
+    EXPECT_FALSE(pages.isCleanFile(memory, mappingOf(0x1000, 1, 9))) << "not on a disk of this machine";
+    EXPECT_FALSE(pages.isCleanFile(memory, mappingOf(0x1000, 1, 11))) << "not mounted here";
+    EXPECT_FALSE(pages.isCleanFile(memory, mappingOf(0x2000, 2))) << "just written";
+    EXPECT_FALSE(pages.isCleanFile(memory, mappingOf(0x3000, 3))) << "gone meanwhile";
+
+    ASSERT_TRUE(hasCleanPages("20/map_files/2000-3000"));
+    write("20/map_files/1000-2000", "dirty");
+    EXPECT_TRUE(pages.isCleanFile(memory, mappingOf(0x1000, 1))) << "looked at once for a measurement";
+    EXPECT_TRUE(pages.isCleanFile(memory, mappingOf(0x9000, 1))) << "wherever it is mapped";
+    pages.begin();
+    EXPECT_FALSE(pages.isCleanFile(memory, mappingOf(0x1000, 1)));
+    EXPECT_TRUE(pages.isCleanFile(memory, mappingOf(0x2000, 2)));
+}
+
+// To open a device can have effects; a named pipe stands for it.
+TEST_F(UncountedPagesTest, NothingButRegularFilesIsOpened) {
+    write("self/mountinfo", "24 1 8:0 / / rw - ext4 /dev/sda rw\n");
+    const std::string pipe = place("20/map_files/1000-2000");
+    ASSERT_EQ(mkfifo(pipe.c_str(), 0600), 0);
+    const procfs::Descriptor watch(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    ASSERT_GE(inotify_add_watch(watch.get(), pipe.c_str(), IN_OPEN), 0);
+    const procfs::Descriptor proc = directory("");
+    const procfs::Descriptor process = directory("20");
+    EXPECT_FALSE(UncountedPages(proc.get()).isCleanFile(process.get(), mappingOf(0x1000, 1)));
+    std::array<char, 256> events = {};
+    EXPECT_LT(read(watch.get(), events.data(), events.size()), 0);
+}
+
+}  // namespace
