@@ -18,6 +18,7 @@
 #include <sstream>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "bench/Population.h"
@@ -322,11 +323,14 @@ private:
         std::vector<double> measured;
         for (int pair = 0; pair < kPairs; ++pair) {
             process.restart();
-            usleep(100'000);
-            undisturbed.push_back(process.slowestMilliseconds());
-            process.restart();
+            const auto begin = std::chrono::steady_clock::now();
             runCommand(_of({process.pid()}));
+            const auto taken = std::chrono::steady_clock::now() - begin;
             measured.push_back(process.slowestMilliseconds());
+            // For as long: the longer one looks, the longer is the longest stall.
+            process.restart();
+            std::this_thread::sleep_for(taken);
+            undisturbed.push_back(process.slowestMilliseconds());
         }
         _table.addFigure("4 GiB, mapping in a loop: longest stall beyond the usual",
                          std::max(0.0, median(measured) - median(undisturbed)), 5, "ms");
