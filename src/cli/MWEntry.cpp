@@ -20,6 +20,7 @@
 #include "output/MWOutputFormatterJSON.h"
 #include "output/MWOutputFormatterStatpack.h"
 #include "platform/MWHostInterface.h"
+#include "platform/MWOutputPlace.h"
 #include "platform/MWTerminalText.h"
 
 namespace {
@@ -68,19 +69,26 @@ bool appendFileFormatter(Formatters& formatters, const std::optional<std::string
     return false;
 }
 
+bool isRegularFile(const std::string& path) {
+    std::error_code error;
+    return std::filesystem::is_regular_file(path, error);
+}
+
 /// Two names of one file, there already or not yet. Devices and pipes take everything.
 bool areOneFile(const std::string& one, const std::string& other) {
     std::error_code error;
-    const auto status = std::filesystem::status(one, error);
-    if (!std::filesystem::exists(status)) {
-        return one == other;
+    if (std::filesystem::exists(one, error) || std::filesystem::exists(other, error)) {
+        return isRegularFile(one) && std::filesystem::equivalent(one, other, error);
     }
-    return std::filesystem::is_regular_file(status) && std::filesystem::equivalent(one, other, error);
+    const auto place = MWOutputPlace::find(one);
+    const auto otherPlace = MWOutputPlace::find(other);
+    return place && otherPlace && place->isSameAs(*otherPlace);
 }
 
 /// A file that two outputs would be written to, or that is a heapsnap to be read and an output as well.
 std::optional<std::string> fileOfTwoUses(const MWMemweightArgs& args) {
-    std::vector<std::string> others;
+    // Where the report goes, unless that is a terminal or a pipe.
+    std::vector<std::string> others = {"/proc/self/fd/" + std::to_string(STDOUT_FILENO)};
     std::ranges::copy_if(
         args.potentialTargetProcesses(), std::back_inserter(others),
         [](const std::string& target) { return MWHostInterface::current().fileExists(target); });

@@ -19,9 +19,9 @@
 
 #include "cli/MWVersion.h"
 #include "output/MWHeapsnapWriter.h"
-#include "output/MWOutputPlace.h"
 #include "output/MWWholeFile.h"
 #include "platform/MWHostInterface.h"
+#include "platform/MWOutputPlace.h"
 #include "platform/MWPhysMemweightSwitch.h"
 #include "platform/MWTerminalText.h"
 #include "platform/MWWorkQueue.h"

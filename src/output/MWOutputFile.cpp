@@ -10,7 +10,7 @@
 #include <system_error>
 #include <utility>
 
-#include "output/MWOutputPlace.h"
+#include "platform/MWOutputPlace.h"
 #include "platform/MWTerminalText.h"
 
 std::unique_ptr<MWOutputFile> MWOutputFile::create(const std::string& path) {

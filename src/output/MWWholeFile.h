@@ -4,7 +4,7 @@
 #include <string>
 
 #include "output/MWOutputFile.h"
-#include "output/MWOutputPlace.h"
+#include "platform/MWOutputPlace.h"
 
 /// A file for its owner alone that gets its name only when it is whole. Until then it has none, or where the
 /// file system knows no such files a temporary one; either is gone with this object.

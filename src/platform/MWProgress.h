@@ -13,8 +13,6 @@ public:
             _steps->fetch_add(1, std::memory_order_relaxed);
         }
     }
-    /// Whether somebody counts the calling thread's steps.
-    static bool isWatched() { return _steps != nullptr; }
     /// Where the calling thread's steps are counted from now on; may be null.
     static void countIn(std::atomic<uint64_t>* steps) { _steps = steps; }
 

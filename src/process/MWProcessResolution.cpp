@@ -4,6 +4,7 @@
 #include <charconv>
 #include <cstddef>
 #include <functional>
+#include <iterator>
 #include <memory>
 #include <new>
 #include <string_view>
@@ -48,19 +49,11 @@ Record recordOfPid(int32_t pid) {
     return info;
 }
 
-/// What `make` makes of each of 0 ... count - 1, on all processors where there is enough to do; where the
-/// system does not answer, what `instead` makes.
+/// What `make` makes of each of 0 ... count - 1; where the system does not answer, what `instead` makes.
 template <class Result>
 std::vector<Result> makeEach(size_t count, const std::function<Result(size_t)>& make,
                              const std::function<Result(size_t)>& instead) {
-    constexpr size_t kWorthThreads = 64;
     const auto results = std::make_shared<std::vector<Result>>(count);
-    if (count < kWorthThreads) {
-        for (size_t index = 0; index < count; ++index) {
-            (*results)[index] = make(index);
-        }
-        return std::move(*results);
-    }
     const MWConcurrentQueue queue("org.memweight.memweight.processes", QOS_CLASS_UTILITY);
     const auto stuck = queue.apply(count, [results, make](size_t index) { (*results)[index] = make(index); });
     if (stuck.empty()) {
@@ -74,11 +67,25 @@ std::vector<Result> makeEach(size_t count, const std::function<Result(size_t)>& 
     return answered;
 }
 
-/// All that is known of a process about which the system does not answer.
+/// Of a record that holds nothing but a pid, as the system does not answer about the process.
+constexpr uint32_t kNotResponding = 1U << 31U;
+
+bool isResponding(const proc_bsdinfo& info) {
+    return (info.pbi_flags & kNotResponding) == 0;
+}
+
 Record recordOfPidAlone(int32_t pid) {
     proc_bsdinfo info = {};
     info.pbi_pid = static_cast<uint32_t>(pid);
+    info.pbi_flags = kNotResponding;
     return info;
+}
+
+/// Those of the pids that are there, in their order.
+std::vector<Record> recordsOfPids(const std::vector<int32_t>& pids) {
+    return makeEach<Record>(
+        pids.size(), [pids](size_t index) { return recordOfPid(pids[index]); },
+        [&](size_t index) { return recordOfPidAlone(pids[index]); });
 }
 
 /// Every process there is now, in the order of the system's list; null when there is no telling.
@@ -87,12 +94,9 @@ std::shared_ptr<const ProcessSnapshot> takeSnapshot() {
     if (!pids) {
         return nullptr;
     }
-    const auto records = makeEach<Record>(
-        pids->size(), [pids = *pids](size_t index) { return recordOfPid(pids[index]); },
-        [&](size_t index) { return recordOfPidAlone((*pids)[index]); });
     auto snapshot = std::make_shared<ProcessSnapshot>();
     snapshot->reserve(pids->size());
-    for (const Record& record : records) {
+    for (const Record& record : recordsOfPids(*pids)) {
         if (record) {
             snapshot->push_back(*record);
         }
@@ -207,7 +211,9 @@ using ChildrenByParent = std::unordered_map<int32_t, std::vector<size_t>>;
 ChildrenByParent childrenByParent(const ProcessSnapshot& snapshot) {
     ChildrenByParent children;
     for (size_t index = 0; index < snapshot.size(); ++index) {
-        children[parentOf(snapshot[index])].push_back(index);
+        if (isResponding(snapshot[index])) {
+            children[parentOf(snapshot[index])].push_back(index);
+        }
     }
     return children;
 }
@@ -225,14 +231,25 @@ std::vector<size_t> childrenOfGeneration(const ChildrenByParent& children, const
     return places;
 }
 
+/// Null for those that cannot be made.
+std::vector<std::shared_ptr<MWProcess>> makeProcesses(ProcessSnapshot snapshot) {
+    const auto records = std::make_shared<const ProcessSnapshot>(std::move(snapshot));
+    return makeEach<std::shared_ptr<MWProcess>>(
+        records->size(), [records](size_t index) { return MWProcess::processWithBsdInfo((*records)[index]); },
+        [&](size_t index) { return std::make_shared<MWUnresponsiveProcess>((*records)[index]); });
+}
+
 }  // namespace
 
 std::shared_ptr<MWProcess> MWProcess::processWithPid(int32_t pid) {
-    const auto info = recordOfPid(pid);
-    return info ? processWithBsdInfo(*info) : nullptr;
+    const Record info = recordsOfPids({pid}).front();
+    return info ? makeProcesses({*info}).front() : nullptr;
 }
 
 std::shared_ptr<MWProcess> MWProcess::processWithBsdInfo(const proc_bsdinfo& info) {
+    if (!isResponding(info)) {
+        return std::make_shared<MWUnresponsiveProcess>(info);
+    }
     if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
         return MWKernelProcess::initWithBsdInfo(info);
     }
@@ -240,7 +257,7 @@ std::shared_ptr<MWProcess> MWProcess::processWithBsdInfo(const proc_bsdinfo& inf
 }
 
 std::string MWProcess::_nameForBsdInfo(const proc_bsdinfo& info) {
-    auto name = executableNameOfPid(pidOf(info));
+    auto name = isResponding(info) ? executableNameOfPid(pidOf(info)) : std::nullopt;
     return name ? *std::move(name) : _nameForBsdInfoCommName(info);
 }
 
@@ -259,15 +276,11 @@ std::optional<MWTargetMap> MWProcess::allProcessesExcludingPids(const std::set<i
     if (!snapshot) {
         return std::nullopt;
     }
-    const auto make = [snapshot, excludedPids](size_t index) {
-        const proc_bsdinfo& info = (*snapshot)[index];
-        return excludedPids.contains(pidOf(info)) ? nullptr : processWithBsdInfo(info);
-    };
-    const auto unresponsive = [&](size_t index) {
-        return std::make_shared<MWUnresponsiveProcess>((*snapshot)[index]);
-    };
+    ProcessSnapshot wanted;
+    std::ranges::copy_if(*snapshot, std::back_inserter(wanted),
+                         [&](const proc_bsdinfo& info) { return !excludedPids.contains(pidOf(info)); });
     MWTargetMap processes;
-    for (auto& process : makeEach<std::shared_ptr<MWProcess>>(snapshot->size(), make, unresponsive)) {
+    for (auto& process : makeProcesses(std::move(wanted))) {
         if (process != nullptr) {
             processes[process->asNumber()] = std::move(process);
         }

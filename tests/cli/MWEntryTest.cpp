@@ -168,7 +168,8 @@ TEST_F(MWEntryFiles, NoFileIsBothReadAndWrittenOrWrittenTwice) {
         {{path("saved.heapsnap"), "-j", path("link")}, path("link")},
         {{path("saved.heapsnap"), "--statpack", path("folder/../saved.heapsnap")},
          path("folder/../saved.heapsnap")},
-        {{"five", "-j", path("new"), "--statpack", path("new")}, path("new")},
+        {{"five", "-j", path("new"), "--statpack", path("./new")}, path("./new")},
+        {{"five", "-j", "/dev/stdout"}, "/dev/stdout"},  // which the test has in a file
     };
     for (const auto& [arguments, file] : cases) {
         const auto refused = run(arguments);

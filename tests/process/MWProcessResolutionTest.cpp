@@ -125,11 +125,11 @@ TEST(MWProcessResolutionTest, UnreadableProcessListIsNoEmptyList) {
 TEST(MWProcessResolutionTest, AProcessThatDoesNotRespondIsAnError) {
     constexpr int32_t kStuck = 30;
     FakeHost inner;
-    for (int32_t pid = 1; pid <= 80; ++pid) {
+    for (int32_t pid = 1; pid <= 40; ++pid) {
         inner.processes[pid] = {.comm = "worker"};
     }
     const std::vector<std::pair<std::string, std::string>> cases = {
-        {"proc_pidinfo", "Unknown [30]: not responding"},  // and again when its task is asked for
+        {"proc_pidinfo", "Unknown [30]: not responding"},
         {"task_read_for_pid", "worker [30]: not responding"},
         {"sysctlArgumentArea", "worker [30]: not responding"},
     };
@@ -139,11 +139,23 @@ TEST(MWProcessResolutionTest, AProcessThatDoesNotRespondIsAnError) {
         const auto processes = MWProcess::allProcessesExcludingPids({});
         host.release();
         ASSERT_TRUE(processes);
-        EXPECT_EQ(processes->size(), 80U);
+        EXPECT_EQ(processes->size(), 40U);
         for (const auto& [pid, process] : *processes) {
-            const bool isStuck = pid == kStuck && operation != "proc_pidinfo";
-            EXPECT_EQ(process->errors(), isStuck ? Lines{message} : Lines{});
+            EXPECT_EQ(process->errors(), pid == kStuck ? Lines{message} : Lines{});
         }
+    }
+    for (const auto& [operation, message] : cases) {
+        FaultyHost host(inner, HostFault{{operation, kStuck, 1}, FaultKind::hangs});
+        const auto process = MWProcess::processWithPid(kStuck);
+        host.release();
+        ASSERT_NE(process, nullptr);
+        EXPECT_EQ(process->errors(), Lines{message});
+    }
+    {
+        FaultyHost host(inner, HostFault{{"proc_pidinfo", kStuck, 1}, FaultKind::hangs});
+        EXPECT_EQ(MWProcess::childPidsForPids({0})->size(), 1U) << "nobody knows whose child it is";
+        host.release();
+        EXPECT_EQ(MWProcess::pidsForStringDescriptions({"30"}, nullptr), (MWPidMap{{kStuck, std::nullopt}}));
     }
 }
 

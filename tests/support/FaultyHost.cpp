@@ -4,7 +4,6 @@
 #include <cerrno>
 #include <chrono>
 
-#include "platform/MWProgress.h"
 #include "platform/MWWorkQueue.h"
 
 FaultyHost::FaultyHost(MWHostInterface& inner, std::optional<HostFault> fault)
@@ -43,7 +42,6 @@ void FaultyHost::waitForChange(std::unique_lock<std::mutex>& lock, std::conditio
 }
 
 std::optional<FaultKind> FaultyHost::_note(const std::string& operation, int32_t pid, Form form) {
-    form.isWatched = MWProgress::isWatched();
     std::unique_lock lock(_mutex);
     const HostQuestion question = {operation, pid, ++_turns[{operation, pid}]};
     _questions.emplace(question, form);
@@ -178,6 +176,21 @@ int FaultyHost::proc_get_dirty(int32_t pid, uint32_t& flags) {
 int FaultyHost::sysctlArgumentMaximum(uint64_t& bytes) {
     return _ask(
         {"sysctlArgumentMaximum"}, [&] { return _inner.sysctlArgumentMaximum(bytes); }, &bytes);
+}
+
+void FaultyHost::surveyOwnedVmObjects(task_t task) {
+    _note("surveyOwnedVmObjects", _pidOf(task), {});
+    _inner.surveyOwnedVmObjects(task);
+}
+
+bool FaultyHost::hasSharedCache(task_t task) {
+    _note("hasSharedCache", _pidOf(task), {});
+    return _inner.hasSharedCache(task);
+}
+
+std::vector<std::string> FaultyHost::takeTaskWarnings(task_t task) {
+    _note("takeTaskWarnings", _pidOf(task), {});
+    return _inner.takeTaskWarnings(task);
 }
 
 int FaultyHost::sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) {

@@ -47,7 +47,6 @@ public:
         bool hasKernelCode = false;
         bool hasErrno = false;
         bool hasAmount = false;
-        bool isWatched = false;  ///< asked by work that can be given up
     };
 
     explicit FaultyHost(MWHostInterface& inner, std::optional<HostFault> fault = {});
@@ -61,10 +60,10 @@ public:
 
     kern_return_t task_read_for_pid(int32_t pid, task_t& task) override;
     void task_release(task_t task) override { _inner.task_release(task); }
-    bool hasSharedCache(task_t task) override { return _inner.hasSharedCache(task); }
+    bool hasSharedCache(task_t task) override;
     kern_return_t mach_vm_region_recurse(task_t task, uint64_t& address, uint64_t& size, uint32_t& depth,
                                          vm_region_submap_info_64& info, uint32_t& count) override;
-    std::vector<std::string> takeTaskWarnings(task_t task) override { return _inner.takeTaskWarnings(task); }
+    std::vector<std::string> takeTaskWarnings(task_t task) override;
     kern_return_t mach_vm_region(task_t task, uint64_t& address, uint64_t& size,
                                  vm_region_basic_info_64& info, uint32_t& count) override;
     kern_return_t mach_vm_purgable_control(task_t task, uint64_t address, int32_t control,
@@ -82,7 +81,7 @@ public:
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
     void beginOwnedVmObjectSurvey() override { _inner.beginOwnedVmObjectSurvey(); }
-    void surveyOwnedVmObjects(task_t task) override { _inner.surveyOwnedVmObjects(task); }
+    void surveyOwnedVmObjects(task_t task) override;
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;

@@ -31,6 +31,8 @@ void ForkCensus::begin() {
     _members.clear();
     _measured = 0;
     _complete = false;
+    _isLooking = false;
+    ++_measurement;
 }
 
 void ForkCensus::addKernelThread(int32_t pid) {
@@ -60,26 +62,50 @@ void ForkCensus::_add(int32_t pid, uint64_t program) {
     }
 }
 
-void ForkCensus::_addOthers() {
+/// Without the lock: the system may let this wait. False when another thread is at it.
+bool ForkCensus::_lookAtOthers() {
+    std::unordered_set<int32_t> known;
+    uint64_t measurement = 0;
+    {
+        const std::lock_guard lock(_mutex);
+        if (_complete || _isLooking) {
+            return _complete;
+        }
+        _isLooking = true;
+        measurement = _measurement;
+        known = _kernelThreads;
+        for (const auto& [pid, program] : _programs) {
+            known.insert(pid);
+        }
+    }
+    std::unordered_map<int32_t, uint64_t> others;
     procfs::forEachEntry(_proc, ".", [&](int directory, const char* name) {
         std::string_view number = name;
         int32_t pid = 0;
-        if (procfs::takeNumber(number, pid) && number.empty() && !_programs.contains(pid) &&
-            !_kernelThreads.contains(pid)) {
+        if (procfs::takeNumber(number, pid) && number.empty() && !known.contains(pid)) {
             const procfs::Descriptor process = procfs::open(directory, name, O_PATH | O_DIRECTORY);
             const std::string auxv = process ? auxiliaryVectorOf(process.get()) : "";
-            _add(pid, auxv.empty() ? 0 : _identity.bytes(auxv));
+            others.emplace(pid, auxv.empty() ? 0 : _identity.bytes(auxv));
         }
         return true;
     });
+    const std::lock_guard lock(_mutex);
+    if (measurement != _measurement) {
+        return false;
+    }
+    for (const auto& [pid, program] : others) {
+        _add(pid, program);
+    }
+    _isLooking = false;
     _complete = true;
+    return true;
 }
 
 bool ForkCensus::isAlone(int32_t pid) {
-    const std::lock_guard lock(_mutex);
-    if (!_complete) {
-        _addOthers();
+    if (!_lookAtOthers()) {
+        return false;
     }
+    const std::lock_guard lock(_mutex);
     const auto found = _programs.find(pid);
     return found != _programs.end() && found->second != 0 && _members.at(found->second) == 1;
 }

@@ -28,12 +28,13 @@ public:
     void add(int32_t pid, uint64_t program);
     /// How many were added.
     size_t measured() const;
-    /// Of a process that was added. The first question looks at all the others of the system.
+    /// Of a process that was added. The first question looks at all the others of the system; to those that
+    /// are asked meanwhile, and to all when it gets no answer, nobody is alone.
     bool isAlone(int32_t pid);
 
 private:
     void _add(int32_t pid, uint64_t program);
-    void _addOthers();
+    bool _lookAtOthers();
 
     int _proc;
     const ObjectIdentity& _identity;
@@ -43,4 +44,6 @@ private:
     std::unordered_set<int32_t> _kernelThreads;
     size_t _measured = 0;
     bool _complete = false;
+    bool _isLooking = false;    ///< a thread looks at the others
+    uint64_t _measurement = 0;  ///< their number: what was begun for an earlier one comes too late
 };

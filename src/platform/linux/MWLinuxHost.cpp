@@ -16,6 +16,7 @@
 #include <optional>
 #include <utility>
 
+#include "platform/MWOutputPlace.h"
 #include "platform/linux/LinuxTask.h"
 #include "platform/linux/LinuxTimer.h"
 
@@ -365,8 +366,7 @@ bool MWLinuxHost::fileExists(const std::string& path) {
 }
 
 void MWLinuxHost::unlinkRegularFile(const std::string& path) {
-    struct stat status = {};
-    if (::lstat(path.c_str(), &status) == 0 && S_ISREG(status.st_mode)) {
-        ::unlink(path.c_str());
+    if (const auto place = MWOutputPlace::findWithoutLast(path)) {
+        place->unlinkRegularFile();
     }
 }

@@ -55,11 +55,15 @@ void OwnedObjectSurvey::begin() {
     _holders.clear();
     _mappedFiles.clear();
     _segments.reset();
-    _targets = std::make_unique<DescriptorTargets>(_system.shmemDevices);
+    _targets = std::make_shared<DescriptorTargets>(_system.shmemDevices);
 }
 
 void OwnedObjectSurvey::add(const ProcessIdentity& process, int directory) {
-    HeldObjects objects = heldObjects(directory, {*_targets, _system.identity, _system.pageSize});
+    const std::shared_ptr<DescriptorTargets> targets = [this] {
+        const std::lock_guard lock(_mutex);
+        return _targets;
+    }();
+    HeldObjects objects = heldObjects(directory, {*targets, _system.identity, _system.pageSize});
     const std::lock_guard lock(_mutex);
     _addSysVSegments(process, objects);
     const auto [known, isNew] = _holders.try_emplace(process, std::move(objects));
@@ -147,7 +151,7 @@ std::vector<OwnedObjectSurvey::Candidate> OwnedObjectSurvey::_candidatesOf(const
     for (const auto& [identifier, object] : found->second) {
         const std::vector<ProcessIdentity>& holders = _holdersOfObject[identifier];
         const bool isOldest = std::ranges::none_of(
-            holders, [&](const ProcessIdentity& other) { return ByIdentity()(other, process); });
+            holders, [&](const ProcessIdentity& holder) { return ByIdentity()(holder, process); });
         if (isOldest) {
             candidates.push_back({object, holders});
         }

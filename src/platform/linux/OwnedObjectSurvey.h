@@ -64,8 +64,8 @@ private:
     System _system;
 
     mutable std::mutex _mutex;  ///< guards what follows
-    /// Replaced when a survey begins, which nobody does during another one.
-    std::unique_ptr<DescriptorTargets> _targets;
+    /// Replaced when a survey begins; one that was given up in the last one keeps the old.
+    std::shared_ptr<DescriptorTargets> _targets;
     /// Of the tool's own IPC namespace.
     std::optional<std::vector<procfs::SysVSegment>> _segments;
     uint64_t _ipcNamespace = 0;

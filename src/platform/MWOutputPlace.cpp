@@ -1,4 +1,4 @@
-#include "output/MWOutputPlace.h"
+#include "platform/MWOutputPlace.h"
 
 #include <fcntl.h>
 #include <linux/magic.h>
@@ -6,6 +6,7 @@
 #include <sys/vfs.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <climits>
@@ -63,24 +64,26 @@ bool mayFollow(const Node& folder, const Node& link) {
     return (of.st_mode & S_IWOTH) == 0 || what.st_uid == geteuid() || what.st_uid == of.st_uid;
 }
 
-std::optional<std::string> targetOf(const Node& link) {
+/// Empty with errno when it cannot be read.
+std::string targetOf(const Node& link) {
     std::array<char, PATH_MAX> buffer = {};
     const ssize_t length = readlinkat(link.get(), "", buffer.data(), buffer.size());
-    return length < 0 ? std::nullopt : std::optional(std::string(buffer.data(), static_cast<size_t>(length)));
+    return {buffer.data(), static_cast<size_t>(std::max<ssize_t>(length, 0))};
 }
 
-/// The first name of a path, taken off it.
+/// The first name of a path, taken off it. The last one keeps the slash that says that it is a folder.
 std::string takeName(std::string& path) {
     const size_t begin = std::min(path.find_first_not_of('/'), path.size());
     const size_t end = std::min(path.find('/', begin), path.size());
     std::string name = path.substr(begin, end - begin);
-    path.erase(0, std::min(path.find_first_not_of('/', end), path.size()));
+    const size_t next = std::min(path.find_first_not_of('/', end), path.size());
+    path.erase(0, next == path.size() ? end : next);
     return name;
 }
 
 }  // namespace
 
-std::optional<MWOutputPlace> MWOutputPlace::find(const std::string& path) {
+std::optional<MWOutputPlace> MWOutputPlace::_find(const std::string& path, bool followsLast) {
     constexpr int kMostLinks = 40;
     int links = 0;
     std::string rest = path;
@@ -92,7 +95,7 @@ std::optional<MWOutputPlace> MWOutputPlace::find(const std::string& path) {
         }
         Node node = look(folder.get(), name, O_NOFOLLOW);
         const bool isNew = !node && errno == ENOENT && rest.empty();
-        const bool isFollowed = node && isLink(node);
+        const bool isFollowed = node && isLink(node) && (followsLast || !rest.empty());
         const bool isKernelLink = isFollowed && isInProc(node);
         if (isNew || (node && rest.empty() && (!isFollowed || isKernelLink))) {
             return MWOutputPlace(folder.release(), name, isKernelLink);
@@ -105,17 +108,31 @@ std::optional<MWOutputPlace> MWOutputPlace::find(const std::string& path) {
             errno = links > kMostLinks ? ELOOP : EACCES;
             return std::nullopt;
         } else {
-            const auto target = targetOf(node);
-            if (!target || target->empty()) {
+            std::string target = targetOf(node);
+            if (target.empty()) {
                 return std::nullopt;
             }
-            rest = *target + (rest.empty() ? "" : "/" + rest);
-            if (target->starts_with('/')) {
-                folder.become(beginningOf(*target));
+            if (target.starts_with('/')) {
+                folder.become(beginningOf(target));
             }
+            rest.insert(0, rest.empty() || rest.starts_with('/') ? target : target.append("/"));
         }
     }
     return std::nullopt;
+}
+
+bool MWOutputPlace::isSameAs(const MWOutputPlace& other) const {
+    struct stat one = {};
+    struct stat another = {};
+    return _name == other._name && fstat(_folder, &one) == 0 && fstat(other._folder, &another) == 0 &&
+           one.st_dev == another.st_dev && one.st_ino == another.st_ino;
+}
+
+void MWOutputPlace::unlinkRegularFile() const {
+    struct stat status = {};
+    if (fstatat(_folder, _name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode)) {
+        unlinkat(_folder, _name.c_str(), 0);
+    }
 }
 
 MWOutputPlace::MWOutputPlace(MWOutputPlace&& other) noexcept
