@@ -9,6 +9,7 @@
 #include <fstream>
 #include <string>
 
+#include "platform/linux/Cachestat.h"
 #include "platform/linux/Procfs.h"
 
 /// A tree of recorded files in the place of procfs, for the length of a test.
@@ -28,6 +29,13 @@ protected:
     }
     procfs::Descriptor directory(const std::string& path) {
         return procfs::open(AT_FDCWD, (_top + "/" + path).c_str(), O_DIRECTORY);
+    }
+    /// Writes a file's pages back. False where the kernel does not tell then that they are clean.
+    bool makeClean(const std::string& path) {
+        const procfs::Descriptor file = procfs::open(AT_FDCWD, (_top + "/" + path).c_str());
+        fsync(file.get());
+        const auto pages = readCachestat(file.get());
+        return pages && pages->cached != 0 && pages->dirty + pages->writeback == 0;
     }
 
     std::string _top = testing::TempDir() + "memweight-proc-XXXXXX";

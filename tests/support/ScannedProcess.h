@@ -1,5 +1,7 @@
 #pragma once
 
+#include <fmt/format.h>
+
 #include <algorithm>
 #include <cstdint>
 #include <functional>
@@ -52,27 +54,23 @@ public:
         std::vector<std::string> texts;
         for (const BackedVma& backed : vmas) {
             const procfs::Vma& vma = backed.vma;
-            texts.push_back(std::to_string(vma.rss / kPage) + "/" + std::to_string(vma.anonymous / kPage) +
-                            "/" + std::to_string(vma.swap / kPage));
+            texts.push_back(
+                fmt::format("{}/{}/{}", vma.rss / kPage, vma.anonymous / kPage, vma.swap / kPage));
         }
         return texts;
     }
 
 private:
     void _add(const WrittenMapping& mapping) {
-        procfs::Vma& vma = _texts.emplace_back();
-        vma.start = mapping.firstPage * kPage;
-        vma.end = vma.start + mapping.letters.size() * kPage;
-        vma.path = mapping.path;
-        if (vma.path.starts_with('/')) {
-            vma.inode = std::hash<std::string>()(vma.path);
-            vma.deviceMajor = 8;
-            vma.offset = vma.start;
-        }
-        vma.readable = mapping.permissions[0] == 'r';
-        vma.writable = mapping.permissions[1] == 'w';
-        vma.executable = mapping.permissions[2] == 'x';
-        vma.shared = mapping.permissions[3] == 's';
+        const uint64_t start = mapping.firstPage * kPage;
+        const bool isFile = mapping.path.starts_with('/');
+        const uint64_t inode = isFile ? std::hash<std::string>()(mapping.path) : 0;
+        procfs::Vma& vma = _texts.emplace_back(
+            procfs::parseSmaps(fmt::format("{:x}-{:x} {} {:x} {} {} {}", start,
+                                           start + mapping.letters.size() * kPage, mapping.permissions,
+                                           isFile ? start : 0, isFile ? "08:00" : "00:00", inode,
+                                           mapping.path))
+                .front());
         vmas.push_back({vma, mapping.backing});
         for (size_t page = 0; page < mapping.letters.size(); ++page) {
             _addPage(vma.start + page * kPage, mapping.letters[page]);

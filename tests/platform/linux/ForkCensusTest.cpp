@@ -27,26 +27,22 @@ protected:
 };
 
 TEST_F(ForkCensusTest, WhoeverHasAForkIsNotAlone) {
-    writeThread("10", 'S', "measured");
-    writeThread("11", 'S', "forked");
-    writeThread("12", 'S', "measured alone");
-    writeThread("30", 'S', "forked");  // not measured
-    writeThread("31", 'S', "another program");
-    writeThread("2", 'S', "");  // a kernel thread
+    // Not measured: another process of one program, a kernel thread, one that lives in its second thread.
+    writeThread("30", 'S', "forked");
+    writeThread("2", 'S', "");
     writeThread("40", 'Z', "");
     writeThread("40/task/40", 'Z', "");
     writeThread("40/task/41", 'S', "without its first thread");
-    writeThread("50", 'Z', "");
     for (const char* noProcess : {"12x", "self", "0x0c"}) {
-        writeThread(noProcess, 'S', "measured alone");
+        writeThread(noProcess, 'S', "alone");
     }
     ForkCensus census(_proc.get(), _identity);
     census.begin();
-    census.add(10, programOf("measured"));
-    census.add(11, programOf("forked"));
-    census.add(12, programOf("measured alone"));
-    census.add(13, programOf("measured"));
-    census.add(14, programOf("without its first thread"));
+    const char* const measured[] = {"twice", "forked", "alone", "twice", "without its first thread"};
+    for (int32_t pid = 10; const char* auxv : measured) {
+        writeThread(std::to_string(pid), 'S', auxv);
+        census.add(pid++, programOf(auxv));
+    }
     census.add(15, 0);
     EXPECT_EQ(census.measured(), 6U);
     EXPECT_FALSE(census.isAlone(10)) << "two are measured";

@@ -1,16 +1,12 @@
 #include "platform/linux/MappingCounts.h"
 
-#include <fcntl.h>
-#include <fmt/format.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <functional>
 #include <optional>
 #include <string>
 #include <vector>
 
-#include "platform/linux/Cachestat.h"
 #include "support/RecordedTree.h"
 #include "support/ScannedProcess.h"
 
@@ -48,10 +44,7 @@ protected:
         write("vmstat", "pglazyfree 0\n");
         write("self/mountinfo", "24 1 8:0 / / rw - ext4 /dev/sda rw\n");
         write("20/map_files/10000-14000", "a program");
-        const auto file = procfs::open(AT_FDCWD, (_top + "/20/map_files/10000-14000").c_str());
-        fsync(file.get());
-        const auto pages = readCachestat(file.get());
-        if (!pages || pages->cached == 0) {
+        if (!makeClean("20/map_files/10000-14000")) {
             GTEST_SKIP() << "the kernel does not tell of a file's pages here whether they are clean";
         }
     }
@@ -93,16 +86,10 @@ protected:
 };
 
 TEST_F(MappingCountsTest, CountsAPlainProcess) {
-    Measured measured = plainProcess();
-    ASSERT_TRUE(isCounted(measured));
+    ASSERT_TRUE(isCounted(plainProcess()));
     EXPECT_EQ(process->counts(), (Counts{"3/0/0", "2/1/0", "3/3/0", "1/1/0", "0/0/0"}));
     EXPECT_FALSE(counts->sharesByFork);
     EXPECT_EQ(counts->filePages.size(), 4U) << "the text's two ranges, and two pages of the data";
-
-    measured.anonymous().letters = "PwwP";
-    measured.status.vmSwap = 2 * ScannedProcess::kPage;
-    ASSERT_TRUE(isCounted(measured));
-    EXPECT_EQ(process->counts()[2], "2/2/2");
 }
 
 TEST_F(MappingCountsTest, OfMemoryThatIsSharedByForkOnePageIsEnough) {
@@ -122,73 +109,65 @@ TEST_F(MappingCountsTest, OfMemoryThatIsSharedByForkOnePageIsEnough) {
 
 TEST_F(MappingCountsTest, DeclinesWhereSmapsTellsMore) {
     struct Row {
-        const char* why;
+        const char* what;
+        bool isCounted;
         std::function<void(Measured&)> change;
     };
-    const auto append = [](WrittenMapping mapping) {
+    const auto with = [](const WrittenMapping& mapping) {
         return [=](Measured& measured) { measured.mappings.push_back(mapping); };
     };
+    const auto swapped = [](uint64_t bytes, bool hasFork) {
+        return [=](Measured& measured) {
+            measured.anonymous().letters = "Pw";
+            measured.status.vmSwap = bytes;
+            measured.hasFork = hasFork;
+        };
+    };
     for (const Row& row : std::vector<Row>{
-             {"locked", [](Measured& measured) { measured.status.vmLck = 4096; }},
-             {"huge pages", [](Measured& measured) { measured.status.hugetlbPages = 2U << 20U; }},
-             {"a shadow stack", [](Measured& measured) { measured.status.hasShadowStack = true; }},
-             {"mapped huge pages", append({512, ".", Backing::hugetlb})},
-             {"can write to a file", append({80, ".", Backing::file, "rw-s", "/bin/x"})},
-             {"a device's file", append({80, ".", Backing::file, "rw-p", "/dev/card"})},
-             {"a device's memory", append({80, ".", Backing::shmem, "rw-s", "/dev/card"})},
-             {"an unknown special", append({80, "F", Backing::special, "rw-s", "anon_inode:[io_uring]"})},
-             {"a guard", append({80, ".", Backing::anonymous, "---p"})},
-             {"memory below the stack", append({90001, "P"})},
-             {"a possible arena", append({kArenaPages, std::string(kArenaPages, '.')})},
-             {"an allocator's library", append({80, "P", Backing::file, "r-xp", "/lib/libjemalloc.so.2"})},
-             {"constants that nobody wrote", append({21, ".", Backing::file, "r--p", "/bin/x"})},
-             {"entries like swapped pages", [](Measured& measured) { measured.anonymous().letters = "Pw"; }},
-             {"more swapped than seen", [](Measured& measured) { measured.status.vmSwap = 4096; }},
-             {"frames without a page", append({80, "K", Backing::file, "r--s", "/bin/x"})},
-             {"shared by fork and swapped",
-              [](Measured& measured) {
-                  measured.hasFork = true;
-                  measured.anonymous().letters = "Pw";
-                  measured.status.vmSwap = 4096;
-              }},
-             {"pages that cannot be read",
+             {"as it is", true, [](Measured&) {}},
+             {"locked", false, [](Measured& measured) { measured.status.vmLck = 4096; }},
+             {"huge pages", false, [](Measured& measured) { measured.status.hugetlbPages = 2U << 20U; }},
+             {"a shadow stack", false, [](Measured& measured) { measured.status.hasShadowStack = true; }},
+             {"mapped huge pages", false, with({512, ".", Backing::hugetlb})},
+             {"can write to a file", false, with({80, ".", Backing::file, "rw-s", "/bin/x"})},
+             {"shares it as it is", true, with({80, "F", Backing::file, "r--s", "/bin/x"})},
+             {"a device's file", false, with({80, ".", Backing::file, "rw-p", "/dev/card"})},
+             {"a device's memory", false, with({80, ".", Backing::shmem, "rw-s", "/dev/card"})},
+             {"an unknown special", false, with({80, "F", Backing::special, "rw-s", "anon_inode:[x]"})},
+             {"the kernel's clock", true, with({80, "K", Backing::special, "r--p", "[vvar_vclock]"})},
+             {"a guard", false, with({80, ".", Backing::anonymous, "---p"})},
+             {"memory below the stack", false, with({90001, "P"})},
+             {"a possible arena", false, with({kArenaPages, std::string(kArenaPages, '.')})},
+             {"off its place", true, with({kArenaPages - 1, std::string(kArenaPages, '.')})},
+             {"an allocator", false, with({80, "P", Backing::file, "r-xp", "/lib/libjemalloc.so.2"})},
+             {"constants that nobody wrote", false, with({21, ".", Backing::file, "r--p", "/bin/x"})},
+             {"constants that are written", true, with({21, "P", Backing::file, "r--p", "/bin/x"})},
+             {"frames without a page", false, with({80, "K", Backing::file, "r--s", "/bin/x"})},
+             {"a file that is gone", false, with({80, "F", Backing::file, "rw-p", "/lib/y"})},
+             {"its written copies", true, with({80, "P", Backing::file, "rw-p", "/lib/y"})},
+             {"entries like swapped pages", false, swapped(0, false)},
+             {"as much swapped as seen", true, swapped(4096, false)},
+             {"more swapped than seen", false, swapped(8192, false)},
+             {"shared by fork and swapped", false, swapped(4096, true)},
+             {"pages that cannot be read", false,
               [](Measured& measured) {
                   measured.hasFork = true;
                   measured.canReadPages = false;
               }},
-             {"no scan", [](Measured& measured) { measured.canScan = false; }},
-             {"a file that is not there any more", append({80, "F", Backing::file, "rw-p", "/lib/y"})},
+             {"no scan", false, [](Measured& measured) { measured.canScan = false; }},
          }) {
         Measured measured = plainProcess();
         row.change(measured);
         std::ranges::sort(measured.mappings, {}, &WrittenMapping::firstPage);
-        EXPECT_FALSE(isCounted(measured)) << row.why;
-    }
-    EXPECT_TRUE(isCounted(plainProcess()));
-    write("vmstat", "pglazyfree 1\n");
-    EXPECT_FALSE(isCounted(plainProcess())) << "any page can be a lazily freed one";
-}
-
-// What is next to each of the above and does not matter.
-TEST_F(MappingCountsTest, CountsWhatOnlyLooksLikeThat) {
-    const std::vector<WrittenMapping> mappings = {
-        {80, "F", Backing::file, "r--s", "/bin/x"},
-        {80, "P", Backing::file, "rw-p", "/lib/y"},
-        {2 * kArenaPages - 1, std::string(kArenaPages, '.')},
-        {80, "K", Backing::special, "r--p", "[vvar_vclock]"},
-        {21, "P", Backing::file, "r--p", "/bin/x"},
-    };
-    for (const WrittenMapping& mapping : mappings) {
-        Measured measured = plainProcess();
-        measured.mappings.push_back(mapping);
-        std::ranges::sort(measured.mappings, {}, &WrittenMapping::firstPage);
-        EXPECT_TRUE(isCounted(measured)) << mapping.path << " at " << mapping.firstPage;
+        EXPECT_EQ(isCounted(measured), row.isCounted) << row.what;
     }
     for (const char* path : {"/dev/shm/buffer", "/dev/zero", "/memfd:x"}) {
         Measured measured = plainProcess();
-        measured.mappings.push_back({80, "F.F", Backing::shmem, "rw-s", path});
+        with({90020, "F.F", Backing::shmem, "rw-s", path})(measured);
         EXPECT_EQ(isCounted(measured), !isSwapInUse) << path << ": what of it is in swap cannot be seen";
     }
+    write("vmstat", "pglazyfree 1\n");
+    EXPECT_FALSE(isCounted(plainProcess())) << "any page can be a lazily freed one";
 }
 
 }  // namespace
