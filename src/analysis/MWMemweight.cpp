@@ -57,8 +57,8 @@ MWProcessList MWMemweight::_processesBySortingPidDesc(MWProcessList processes) {
 // One that takes long must not be begun when all the others are done and the other processors have nothing
 // left to do.
 MWProcessList MWMemweight::_longestFirst(MWProcessList processes) {
-    std::ranges::stable_partition(processes,
-                                  [](const auto& process) { return process->takesLongToGather(); });
+    std::stable_partition(processes.begin(), processes.end(),
+                          [](const auto& process) { return process->takesLongToGather(); });
     return processes;
 }
 

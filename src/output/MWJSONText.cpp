@@ -46,8 +46,9 @@ size_t appendSpecial(std::string& to, std::string_view text) {
         fmt::format_to(std::back_inserter(to), "\\\\x{:02x}", static_cast<uint8_t>(text.front()));
         return 1;
     }
-    if (length == 1) {
-        appendEscaped(to, text.front());
+    const bool isC1Control = length == 2 && text[0] == '\xC2' && static_cast<uint8_t>(text[1]) < 0xA0;
+    if (length == 1 || isC1Control) {
+        appendEscaped(to, text[length - 1]);  // also for whoever looks at the file on a terminal
     } else {
         to += text.substr(0, length);
     }

@@ -200,8 +200,8 @@ public:
     virtual bool isatty(int descriptor) = 0;
     /// Whether a file system object of this path exists (stat succeeds).
     virtual bool fileExists(const std::string& path) = 0;
-    /// Removes `path` if it is a regular file; devices, pipes, links and directories are left alone. No link that
-    /// somebody else planted is followed on the way (see MWOutputPlace).
+    /// Removes `path` if it is a regular file; devices, pipes, links and directories are left alone. No link
+    /// that somebody else planted is followed on the way (see MWOutputPlace).
     virtual void unlinkRegularFile(const std::string& path) = 0;
 
 private:

@@ -12,7 +12,9 @@ public:
     /// None with errno; EACCES for a link that is not followed.
     static std::optional<MWOutputPlace> find(const std::string& path) { return _find(path, true); }
     /// The same, but for a link that the path itself is: that one is the place then.
-    static std::optional<MWOutputPlace> findWithoutLast(const std::string& path) { return _find(path, false); }
+    static std::optional<MWOutputPlace> findWithoutLast(const std::string& path) {
+        return _find(path, false);
+    }
     ~MWOutputPlace();
     MWOutputPlace(MWOutputPlace&& other) noexcept;
     MWOutputPlace& operator=(MWOutputPlace&&) = delete;

@@ -100,7 +100,8 @@ void MWWatchedWork::_watch(std::unique_lock<std::mutex>& lock) {
         // While this program itself was stopped nobody could get any further.
         const uint64_t elapsed = std::min(now - looked, 2 * kLookInterval);
         looked = now;
-        for (size_t index = 0; index < _workers.size(); ++index) {
+        // One that is given up can be followed by another.
+        for (size_t index = 0; index != _workers.size(); ++index) {  // NOLINT(modernize-loop-convert)
             _lookAt(*_workers[index], elapsed);
         }
     }

@@ -13,7 +13,9 @@ namespace {
 
 TEST(MWTerminalText, LetsNothingThroughThatSteersATerminal) {
     const std::vector<std::pair<std::string, std::string>> cases = {
-        {R"(plain "text" \ ~ é)", R"(plain "text" \ ~ é)"},
+        {R"(plain "text" ~ é)", R"(plain "text" ~ é)"},
+        {R"(not \n)", R"(not \\n)"},
+        {"a\u202eb\u2068c\u2028", R"(a\342\200\256b\342\201\250c\342\200\250)"},
         {"\u20ac \U0001F600", "\u20ac \U0001F600"},
         {"\x1b[31mred\a\b\t\n\v\f\r\x7f", R"(\033[31mred\a\b\t\n\v\f\r\177)"},
         {std::string(1, '\0') + "1", R"(\0001)"},

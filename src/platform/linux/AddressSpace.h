@@ -57,7 +57,7 @@ struct AddressSpaceRegion {
 class AddressSpace {
 public:
     /// Takes the mappings' paths.
-    AddressSpace(const std::vector<BackedVma>& vmas, const AddressSpaceOwner& owner, PageSource& pages,
+    AddressSpace(const std::vector<BackedVma>& backed, const AddressSpaceOwner& owner, PageSource& pages,
                  const AddressSpaceContext& context);
 
     const std::vector<AddressSpaceRegion>& regions() const { return _regions; }
