@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <array>
+#include <ctime>
 #include <vector>
 
 #include "platform/MWProgress.h"
@@ -35,11 +36,32 @@ int LivePages::_file() {
     return _pagemap.get();
 }
 
+// The kernel takes the process's memory map once more before the process, which waits to change it, has woken
+// up: without a pause it waits for 4 ms at each turn, until the kernel sees to it.
+void LivePages::_giveWay(uint64_t pages) {
+    constexpr uint64_t kMostInARow = 16384;
+    constexpr timespec kPause = {.tv_sec = 0, .tv_nsec = 50'000};
+    _pagesInARow += pages;
+    if (_pagesInARow >= kMostInARow) {
+        _pagesInARow = 0;
+        nanosleep(&kPause, nullptr);
+    }
+}
+
+int LivePages::scan(const PageScan& scan, std::span<ScannedRange> ranges, uint64_t& walkEnd) {
+    const int count = scanPages(_file(), scan, ranges, walkEnd);
+    for (const ScannedRange& range : ranges.first(static_cast<size_t>(std::max(count, 0)))) {
+        _giveWay((range.end - range.start) / _facts.pageSize);
+    }
+    return count;
+}
+
 bool LivePages::readPages(uint64_t address, std::span<PagemapEntry> entries) {
     const auto bytes = std::as_writable_bytes(entries);
     const auto offset = static_cast<off_t>(address / _facts.pageSize * sizeof(PagemapEntry));
     const ssize_t count = pread(_file(), bytes.data(), bytes.size(), offset);
     MWProgress::mark();
+    _giveWay(entries.size());
     if (count != static_cast<ssize_t>(bytes.size())) {
         return false;
     }

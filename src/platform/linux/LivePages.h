@@ -33,14 +33,14 @@ public:
     uint64_t nextPopulated(uint64_t address, uint64_t end) override;
     bool knowsHoles() override;
     /// See scanPages.
-    int scan(const PageScan& scan, std::span<ScannedRange> ranges, uint64_t& walkEnd) {
-        return scanPages(_file(), scan, ranges, walkEnd);
-    }
+    int scan(const PageScan& scan, std::span<ScannedRange> ranges, uint64_t& walkEnd);
 
 private:
     int _file();
+    void _giveWay(uint64_t pages);
     void _clearByFlags(std::span<PagemapEntry> entries) const;
 
+    uint64_t _pagesInARow = 0;  ///< looked at since the process could change its memory map
     int _memoryDirectory;
     PageFacts _facts;
     procfs::Descriptor _pagemap;
