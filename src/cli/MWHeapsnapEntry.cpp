@@ -147,7 +147,11 @@ bool writeWatched(const std::shared_ptr<MWRecordedProcess>& process,
     const auto isWhole = std::make_shared<std::atomic<bool>>(false);
     const MWConcurrentQueue queue("org.memweight.memweight.heapsnap", QOS_CLASS_USER_INITIATED);
     const auto stuck = queue.apply(1, [=](size_t) { *isWhole = writeSnapshot(*process, file->contents()); });
-    return stuck.empty() ? isWhole->load() : fail(process->displayString(), "not responding");
+    if (stuck.empty()) {
+        return *isWhole;
+    }
+    file->giveUp();
+    return fail(process->displayString(), "not responding");
 }
 
 bool save(const std::shared_ptr<MWRecordedProcess>& process, const std::string& path, bool force) {

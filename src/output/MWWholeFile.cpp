@@ -1,8 +1,12 @@
 #include "output/MWWholeFile.h"
 
 #include <fcntl.h>
+#include <fmt/format.h>
+#include <fmt/ranges.h>
+#include <sys/random.h>
 #include <unistd.h>
 
+#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <utility>
@@ -14,7 +18,10 @@ constexpr unsigned kForItsOwner = 0600;
 }  // namespace
 
 std::unique_ptr<MWWholeFile> MWWholeFile::create(MWOutputPlace place) {
-    const std::string temporary = place.name() + ".tmp" + std::to_string(getpid());
+    // Nobody can tell which name to take first.
+    std::array<unsigned char, 8> random = {};
+    static_cast<void>(getrandom(random.data(), random.size(), 0) < 0);
+    const std::string temporary = fmt::format(".memweight-{:02x}", fmt::join(random, ""));
     std::unique_ptr<MWWholeFile> file(new MWWholeFile(std::move(place), temporary));
     const int folder = file->_place.folder();
     int descriptor = openat(folder, ".", O_TMPFILE | O_WRONLY | O_CLOEXEC, kForItsOwner);
@@ -30,6 +37,10 @@ std::unique_ptr<MWWholeFile> MWWholeFile::create(MWOutputPlace place) {
 }
 
 MWWholeFile::~MWWholeFile() {
+    giveUp();
+}
+
+void MWWholeFile::giveUp() const {
     if (_isNamed) {
         unlinkat(_place.folder(), _temporary.c_str(), 0);
     }
@@ -39,8 +50,16 @@ int MWWholeFile::publish(bool replaced) {
     if (_contents->error() != 0) {
         return _contents->error();
     }
-    if (!_isNamed && !replaced) {
-        return _link(_place.name()) ? _contents->finish() : errno;
+    // Most often there is nothing to replace, and no other name is needed.
+    if (!_isNamed && _link(_place.name())) {
+        const int error = _contents->finish();
+        if (error != 0) {
+            unlinkat(_place.folder(), _place.name().c_str(), 0);
+        }
+        return error;
+    }
+    if (!_isNamed && (!replaced || errno != EEXIST)) {
+        return errno;
     }
     _isNamed = _isNamed || _link(_temporary);
     if (!_isNamed) {

@@ -17,6 +17,8 @@ public:
     MWWholeFile& operator=(const MWWholeFile&) = delete;
 
     MWOutputFile& contents() { return *_contents; }
+    /// Removes the temporary name, if there is one: the program will end without destroying anything.
+    void giveUp() const;
     /// Closes the file and gives it its name, in the place of a file that has it where that is `replaced`.
     /// The first error of it all, from the first write on, as errno; 0 when all is well.
     int publish(bool replaced);
