@@ -141,12 +141,31 @@ bool writeSnapshot(MWRecordedProcess& process, MWOutputFile& file) {
     return errors.empty();
 }
 
-/// On a thread that can be given up, which then keeps what it works on.
+/// What it runs can be given up, and then keeps what it works on.
+MWConcurrentQueue watchedQueue() {
+    return {"org.memweight.memweight.heapsnap", QOS_CLASS_USER_INITIATED};
+}
+
+/// None when the process cannot be read; the user has then been told.
+std::shared_ptr<MWRecordedProcess> processToSave(int32_t pid) {
+    const auto process = std::make_shared<std::shared_ptr<MWRecordedProcess>>();
+    const auto stuck =
+        watchedQueue().apply(1, [=](size_t) { *process = MWRecordedProcess::processWithPid(pid); });
+    if (!stuck.empty()) {
+        fail(std::to_string(pid), "not responding");
+        return nullptr;
+    }
+    if (*process == nullptr) {
+        fail(std::to_string(pid), "unable to read this process (try as root?)");
+    }
+    return *process;
+}
+
 bool writeWatched(const std::shared_ptr<MWRecordedProcess>& process,
                   const std::shared_ptr<MWWholeFile>& file) {
     const auto isWhole = std::make_shared<std::atomic<bool>>(false);
-    const MWConcurrentQueue queue("org.memweight.memweight.heapsnap", QOS_CLASS_USER_INITIATED);
-    const auto stuck = queue.apply(1, [=](size_t) { *isWhole = writeSnapshot(*process, file->contents()); });
+    const auto stuck =
+        watchedQueue().apply(1, [=](size_t) { *isWhole = writeSnapshot(*process, file->contents()); });
     if (stuck.empty()) {
         return *isWhole;
     }
@@ -184,9 +203,8 @@ int MWHeapsnapMain(int argc, char* const argv[]) {
     if (arguments->breakDown) {
         MWPhysMemweightSwitch::set(true);
     }
-    const auto process = MWRecordedProcess::processWithPid(arguments->pid);
+    const auto process = processToSave(arguments->pid);
     if (process == nullptr) {
-        fail(std::to_string(arguments->pid), "unable to read this process (try as root?)");
         return kFailure;
     }
     return save(process, arguments->file.value_or(defaultFile(*process)), arguments->force) ? kSuccess
