@@ -66,7 +66,7 @@ bool MWMemweight::gatherData() {
     // Most have some dozens of regions.
     constexpr size_t kKeptOfProcess = 20000;
     _gatherStartTime = MWTime::now();
-    MWHostInterface::current().beginOwnedVmObjectSurvey();
+    MWHostInterface::current().beginSurvey();
     MWProcessList processes = _processesBySortingPidDesc(_processes);
     std::erase_if(processes, [this](const std::shared_ptr<MWProcess>& process) {
         const bool isStuck = StuckProcesses::contain(*process);

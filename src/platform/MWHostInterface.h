@@ -140,13 +140,20 @@ public:
     /// What the template says, read on first use and once, whichever thread comes first.
     const MWLedgerTable& ledgerTable();
 
+    // Surveys.
+
+    /// Some answers depend on who else is measured: an object that several processes hold is charged to one
+    /// of them, and memory that nobody else of a measurement shares need not be looked up for its sharers. A
+    /// measurement begins a survey and then names each task that it will ask about, before it asks about the
+    /// first, and whether it will ask for the objects that the task owns. What asks without a survey gets
+    /// answers that hold whoever is measured.
+    virtual void beginSurvey() {}
+    virtual void surveyTask(task_t, bool withOwnedVmObjects) { static_cast<void>(withOwnedVmObjects); }
+    /// A process is measured that was saved on an earlier day, which can have shared anybody's memory.
+    virtual void surveySavedProcess() {}
+
     // System controls by name.
 
-    /// An object that several processes hold is charged to one of them. To choose it, the host can look at
-    /// all processes of a measurement before it is asked about the first: a measurement begins a survey and
-    /// then has each process that it will ask about looked at.
-    virtual void beginOwnedVmObjectSurvey() {}
-    virtual void surveyOwnedVmObjects(task_t) {}
     /// "vm.get_owned_vmobjects" for a task: the reply's bytes go to `reply` (none asks for the length
     /// alone), `length` is the room on entry and the bytes needed or written on return. ENOENT where the
     /// system has no such control.

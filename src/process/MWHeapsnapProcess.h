@@ -6,6 +6,7 @@
 #include <tl/expected.hpp>
 
 #include "platform/HeapsnapReader.h"
+#include "platform/MWHostInterface.h"
 #include "process/MWUserProcess.h"
 
 /// Codes of MWError in the domain MemweightErrorDomain.
@@ -32,6 +33,7 @@ public:
     uint64_t _gatherPageSize() override { return _graph->process().pageSize; }
     bool _populateTask() override { return true; }
     bool _isAlive() const override { return false; }
+    void prepareToGatherData() override { MWHostInterface::current().surveySavedProcess(); }
 
 protected:
     explicit MWHeapsnapProcess(std::unique_ptr<HeapsnapReader> graph) : _graph(std::move(graph)) {}

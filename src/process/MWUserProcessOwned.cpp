@@ -82,8 +82,8 @@ bool MWUserProcess::_asksForOwnedVmObjects() const {
 
 // Also one that is gathered already: what it holds is not to be charged to another.
 void MWUserProcess::prepareToGatherData() {
-    if (_isAlive() && _asksForOwnedVmObjects()) {
-        MWHostInterface::current().surveyOwnedVmObjects(*_task);
+    if (_task && _isAlive()) {
+        MWHostInterface::current().surveyTask(*_task, _asksForOwnedVmObjects());
     }
 }
 

@@ -18,10 +18,7 @@ protected:
     AddressSpace build(const std::string& smaps, int32_t pid = 10, uint64_t ipcNamespace = 1) {
         std::vector<procfs::Vma> vmas = procfs::parseSmaps(smaps);
         return {backedVmas(vmas, _devices, -1),
-                {.pid = pid,
-                 .startTime = 5,
-                 .ipcNamespace = ipcNamespace,
-                 .family = [this]() -> ForkFamily& { return _family; }},
+                {.pid = pid, .startTime = 5, .ipcNamespace = ipcNamespace, .family = _familyOf},
                 _pages,
                 {_identity, _devices, _names, kPage}};
     }
@@ -44,6 +41,7 @@ protected:
     ShmemDevices _devices;
     RegionNames _names;
     ForkFamily _family{77};
+    std::function<ForkFamily&()> _familyOf = [this]() -> ForkFamily& { return _family; };
     WrittenPages _pages;
 };
 
@@ -122,6 +120,35 @@ TEST_F(AddressSpaceTest, LazilyFreedPagesCountAsDirtyWhileTheyAreShared) {
     EXPECT_EQ(space.regions()[0].info.pages_dirtied, 4U) << "nobody can take what another process has";
     EXPECT_EQ(space.regions()[1].info.pages_reusable, 4U);
     EXPECT_EQ(space.regions()[1].info.pages_dirtied, 0U);
+}
+
+// With whom nobody else is measured, what it shares with others by fork is its own; the file's pages stay the
+// file's.
+TEST_F(AddressSpaceTest, MemoryOfAProcessThatIsMeasuredAloneIsNotCutForItsSharers) {
+    const std::string texts =
+        "100000-108000 rw-p 00000000 00:00 0\nRss: 32 kB\nPss: 24 kB\nShared_Dirty: 16 kB\n"
+        "Private_Dirty: 16 kB\nAnonymous: 32 kB\nSwap: 8 kB\nSwapPss: 4 kB\n"
+        "200000-208000 rw-p 00000000 fe:00 9 /usr/lib/libx.so\nRss: 32 kB\nPss: 24 kB\n"
+        "Shared_Clean: 16 kB\nShared_Dirty: 8 kB\nPrivate_Dirty: 8 kB\nAnonymous: 16 kB\n";
+    writeHalfShared(0x100000, 8);
+    writeHalfShared(0x200000, 8);
+    for (uint64_t page = 2; page < 6; ++page) {
+        _pages.pages[0x200000 + page * kPage] = {uint64_t{5} << 61U};
+    }
+    EXPECT_EQ(build(texts).regions().size(), 5U);
+    _familyOf = nullptr;
+    const AddressSpace alone = build(texts);
+    std::vector<uint64_t> starts;
+    for (const AddressSpaceRegion& region : alone.regions()) {
+        starts.push_back(region.start);
+    }
+    ASSERT_EQ(starts, (std::vector<uint64_t>{0x100000, 0x200000, 0x202000, 0x206000}));
+    EXPECT_EQ(alone.regions()[0].info.pages_dirtied, 8U);
+    EXPECT_EQ(alone.regions()[0].info.pages_swapped_out, 2U);
+    EXPECT_EQ(alone.regions()[1].info.object_id_full, alone.regions()[3].info.object_id_full);
+    EXPECT_EQ(alone.regions()[1].info.pages_dirtied, 2U);
+    EXPECT_EQ(alone.regions()[2].info.pages_dirtied, 0U);
+    EXPECT_EQ(alone.partOfFamilyMemory(), 0U);
 }
 
 TEST_F(AddressSpaceTest, AnonymousMemoryThatWasNeverTouchedBelongsToNoObject) {

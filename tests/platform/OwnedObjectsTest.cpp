@@ -51,14 +51,14 @@ std::vector<OwnedObjectRecord> ownedObjects(MWHostInterface& host, task_t task) 
 class Measured {
 public:
     Measured(MWLinuxHost& host, std::vector<int32_t> pids) : _host(host) {
-        _host.beginOwnedVmObjectSurvey();
+        _host.beginSurvey();
         for (const int32_t pid : pids) {
             task_t task = 0;
             EXPECT_EQ(_host.task_read_for_pid(pid, task), KERN_SUCCESS);
             _tasks.push_back(task);
         }
         for (const task_t task : _tasks) {
-            _host.surveyOwnedVmObjects(task);
+            _host.surveyTask(task, true);
         }
     }
     ~Measured() {
@@ -182,7 +182,7 @@ TEST(OwnedObjects, ASysVSegmentIsItsCreatorsWhileNobodyHasItAttached) {
         EXPECT_EQ(objects[0].resident, 2 * kMiB);
         EXPECT_EQ(objects[0].virtual_size, 3 * kMiB);
         void* attached = shmat(segment, nullptr, SHM_RDONLY);
-        host.beginOwnedVmObjectSurvey();
+        host.beginSurvey();
         EXPECT_TRUE(measured.objectsOf(0).empty());
         shmdt(attached);
     }

@@ -70,6 +70,12 @@ TEST_F(Heapsnaps, IdentityIsTheFilesAndNotThatOfALivingProcess) {
     EXPECT_FALSE((*open())->breakDownPhysMemweight());
 }
 
+// A living process may have to be joined with it.
+TEST_F(Heapsnaps, IsSurveyedLikeALivingProcess) {
+    (*open())->prepareToGatherData();
+    EXPECT_EQ(_host.savedProcessesSurveyed, 1U);
+}
+
 TEST_F(Heapsnaps, TheDescriptionTellsWhereTheSharedCacheLies) {
     struct Case {
         const char* description;

@@ -327,9 +327,9 @@ int FakeHost::ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, s
     return 0;
 }
 
-void FakeHost::surveyOwnedVmObjects(task_t task) {
+void FakeHost::surveyTask(task_t task, bool withOwnedVmObjects) {
     const std::lock_guard lock(_mutex);
-    surveyed.insert(task);
+    surveyed[task] = withOwnedVmObjects;
 }
 
 int FakeHost::sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) {

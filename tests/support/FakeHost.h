@@ -123,7 +123,8 @@ public:
 
     std::vector<std::string> unlinked;
     std::vector<size_t> deallocated;      ///< bytes, in the order in which they were given back
-    std::set<task_t> surveyed;            ///< since the last survey began
+    std::map<task_t, bool> surveyed;      ///< since the last survey began: whether with owned objects
+    size_t savedProcessesSurveyed = 0;    ///< ever
     std::vector<size_t> ownedFetches;     ///< room of each fetch of owned objects, in bytes
     std::vector<std::string> machErrors;  ///< "LABEL: CODE" of each mach_error
     std::vector<std::pair<uint64_t, uint64_t>> pageQueries;  ///< (start, pages) of each page-range query
@@ -157,8 +158,9 @@ public:
     int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
-    void beginOwnedVmObjectSurvey() override { surveyed.clear(); }
-    void surveyOwnedVmObjects(task_t task) override;
+    void beginSurvey() override { surveyed.clear(); }
+    void surveyTask(task_t task, bool withOwnedVmObjects) override;
+    void surveySavedProcess() override { ++savedProcessesSurveyed; }
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;

@@ -178,9 +178,9 @@ int FaultyHost::sysctlArgumentMaximum(uint64_t& bytes) {
         {"sysctlArgumentMaximum"}, [&] { return _inner.sysctlArgumentMaximum(bytes); }, &bytes);
 }
 
-void FaultyHost::surveyOwnedVmObjects(task_t task) {
-    _note("surveyOwnedVmObjects", _pidOf(task), {});
-    _inner.surveyOwnedVmObjects(task);
+void FaultyHost::surveyTask(task_t task, bool withOwnedVmObjects) {
+    _note("surveyTask", _pidOf(task), {});
+    _inner.surveyTask(task, withOwnedVmObjects);
 }
 
 bool FaultyHost::hasSharedCache(task_t task) {

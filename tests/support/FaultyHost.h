@@ -80,8 +80,9 @@ public:
     int sysctlArgumentArea(int32_t pid, std::span<char> area, size_t& length) override;
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
-    void beginOwnedVmObjectSurvey() override { _inner.beginOwnedVmObjectSurvey(); }
-    void surveyOwnedVmObjects(task_t task) override;
+    void beginSurvey() override { _inner.beginSurvey(); }
+    void surveySavedProcess() override { _inner.surveySavedProcess(); }
+    void surveyTask(task_t task, bool withOwnedVmObjects) override;
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;
     int setSysctlSelfRegionMemweight(int32_t value) override;

@@ -133,10 +133,13 @@ public:
     /// `image` is the one whose segment the mapping is, or null.
     void add(const BackedVma& backed, uint32_t tag, const LinuxImage* image) {
         const bool isFileMapping = backed.backing != Backing::anonymous;
-        if (backed.backing != Backing::special && needsOwnershipRuns(backed.vma, isFileMapping)) {
-            const std::vector<OwnershipRun> runs = ownershipRuns(
-                {.vma = backed.vma, .isFileMapping = isFileMapping, .pageSize = _context.pageSize}, _pages,
-                _family().generations());
+        const OwnershipQuestion question = {.vma = backed.vma,
+                                            .isFileMapping = isFileMapping,
+                                            .pageSize = _context.pageSize,
+                                            .isAlone = !_owner.family};
+        if (backed.backing != Backing::special && needsOwnershipRuns(question)) {
+            const std::vector<OwnershipRun> runs =
+                ownershipRuns(question, _pages, question.isAlone ? nullptr : &_family().generations());
             if (!runs.empty()) {
                 _addRuns(backed, {.tag = tag, .file = _fileOf(backed, image)}, runs);
                 _partOfFamilyMemory += _partOf(backed, runs);

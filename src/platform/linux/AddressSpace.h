@@ -20,7 +20,8 @@ struct AddressSpaceOwner {
     int32_t pid = 0;
     uint64_t startTime = 0;  ///< clock ticks since boot: with the pid it names one process of this boot
     uint64_t ipcNamespace = 0;
-    /// Its fork family; asked only where memory is shared by fork.
+    /// Its fork family, asked for only where memory is shared by fork; none where nobody else of it is
+    /// measured.
     std::function<ForkFamily&()> family;
 };
 

@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <ctime>
+#include <functional>
 #include <string>
 #include <unordered_set>
 #include <utility>
@@ -67,7 +68,6 @@ LinuxRun::LinuxRun(const std::string& procDirectory, MappingSource source)
       ownedObjects(
           {.proc = proc.get(), .pageSize = pageSize, .shmemDevices = shmemDevices, .identity = identity}),
       uncountedPages(proc.get()),
-      forkCensus(proc.get(), identity),
       frames(procfs::open(proc.get(), "kpageflags")),
       untouchedPage(lookAtUntouchedPage(proc.get(), pageSize)),
       mappingSource(source) {}
@@ -175,7 +175,7 @@ bool LinuxTask::_runsTheSame() {
     return !_stat.threadEnded() && _stat.isSameProgramAs(before);
 }
 
-// Looking at the whole system for what smaps would tell pays off where much is measured.
+// Asking the system for what smaps would tell pays off where much is measured.
 bool LinuxTask::_countsPayOff(const procfs::ProcStatus& status) const {
     constexpr size_t kManyProcesses = 8;
     constexpr uint64_t kLargeProcess = 16U << 20U;
@@ -187,7 +187,8 @@ bool LinuxTask::_countsPayOff(const procfs::ProcStatus& status) const {
 bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
     const int directory = memoryDirectory();
     _pages.emplace(directory, PageFacts{_run.frames, zeroFrameOf(_run.untouchedPage), _run.pageSize});
-    mappings.counts.reset();
+    mappings.isAlone = _run.forkCensus.isAlone(_pid);
+    mappings.filePages.reset();
     const auto current = status();
     if (current && _countsPayOff(*current)) {
         if (!procfs::readMappings(directory, "maps", mappings.texts)) {
@@ -196,15 +197,15 @@ bool LinuxTask::_readMappingsOnce(Mappings& mappings) {
         mappings.vmas = backedVmas(mappings.texts, _run.shmemDevices, directory);
         const PageScanner scan = [this](const PageScan& pages, std::span<ScannedRange> ranges,
                                         uint64_t& end) { return _pages->scan(pages, ranges, end); };
-        mappings.counts = countWithoutSmaps(mappings.vmas,
-                                            {.pid = _pid,
-                                             .memoryDirectory = directory,
-                                             .status = *current,
-                                             .scan = scan,
-                                             .pages = *_pages,
-                                             .pageSize = _run.pageSize},
-                                            _run.uncountedPages, _run.forkCensus);
-        if (mappings.counts) {
+        mappings.filePages = countWithoutSmaps(mappings.vmas,
+                                               {.memoryDirectory = directory,
+                                                .status = *current,
+                                                .scan = scan,
+                                                .pages = *_pages,
+                                                .pageSize = _run.pageSize,
+                                                .isAlone = mappings.isAlone},
+                                               _run.uncountedPages);
+        if (mappings.filePages) {
             return true;
         }
     }
@@ -249,21 +250,20 @@ kern_return_t LinuxTask::takeSnapshot() {
         return code;
     }
     std::optional<ScannedPages> scanned;
-    if (mappings.counts && !mappings.counts->sharesByFork) {
-        scanned.emplace(std::move(mappings.counts->filePages), _run.pageSize);
+    if (mappings.filePages && mappings.isAlone) {
+        scanned.emplace(*std::move(mappings.filePages), _run.pageSize);
     }
     PageSource& pages = scanned ? static_cast<PageSource&>(*scanned) : *_pages;
-    const bool isAlone = scanned.has_value();
+    const auto family = [this]() -> ForkFamily& { return _family(); };
     const ProcessIdentity owner = _run.sharedSpaces.ownerOf(_candidate());
-    _space.emplace(
-        mappings.vmas,
-        AddressSpaceOwner{.pid = owner.pid,
-                          .startTime = owner.startTime,
-                          .ipcNamespace = hasSysVSegments(mappings.vmas)
-                                              ? procfs::readNamespace(memoryDirectory(), "ipc")
-                                              : 0,
-                          .family = [&]() -> ForkFamily& { return isAlone ? _noFamily : _family(); }},
-        pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
+    _space.emplace(mappings.vmas,
+                   AddressSpaceOwner{.pid = owner.pid,
+                                     .startTime = owner.startTime,
+                                     .ipcNamespace = hasSysVSegments(mappings.vmas)
+                                                         ? procfs::readNamespace(memoryDirectory(), "ipc")
+                                                         : 0,
+                                     .family = mappings.isAlone ? std::function<ForkFamily&()>() : family},
+                   pages, AddressSpaceContext{_run.identity, _run.shmemDevices, _run.names, _run.pageSize});
     if (owner.pid == _pid) {
         _checkFamilyMemory();
     }
@@ -303,10 +303,10 @@ bool LinuxTask::sharesAnothersSpace() {
     return _run.sharedSpaces.ownerOf(_candidate()).pid != _pid;
 }
 
-void LinuxTask::survey() {
-    _surveyOwnedObjects();
-    if (_run.mappingSource == MappingSource::cheapest) {
-        _run.forkCensus.add(_pid, _program);
+void LinuxTask::survey(bool withOwnedObjects) {
+    _run.forkCensus.add(_pid, _program);
+    if (withOwnedObjects) {
+        _surveyOwnedObjects();
     }
 }
 

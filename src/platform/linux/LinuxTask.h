@@ -111,8 +111,9 @@ public:
 
     /// Whether its memory goes under another process's name, with which it shares one address space.
     bool sharesAnothersSpace();
-    /// Looks at what the process holds through descriptors and at its family, before any process is measured.
-    void survey();
+    /// Counts the process among those of the measurement, and looks at what it holds through descriptors if
+    /// so wanted, before any process is measured.
+    void survey(bool withOwnedObjects);
     /// What the process is charged for beside its regions. May take a snapshot.
     std::vector<OwnedObjectRecord> ownedObjects();
 
@@ -126,8 +127,10 @@ private:
 
     struct Mappings {
         std::vector<procfs::Vma> texts;
-        std::vector<BackedVma> vmas;          ///< of `texts`
-        std::optional<MappingCounts> counts;  ///< where smaps was not read
+        std::vector<BackedVma> vmas;  ///< of `texts`
+        bool isAlone = false;         ///< see ForkCensus
+        /// Where smaps was not read: see countWithoutSmaps.
+        std::optional<std::vector<ScannedRange>> filePages;
 
         /// Gives the room of very many mappings back, which few processes need.
         void forgetMany();
@@ -156,7 +159,6 @@ private:
     std::optional<procfs::ProcStatus> _status;
     uint64_t _statusTime = 0;                 ///< nanoseconds of CLOCK_MONOTONIC
     std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live
-    ForkFamily _noFamily{0};                  ///< of a process that shares nothing by fork
     std::vector<std::string> _warnings;
     std::optional<LivePages> _pages;
     std::optional<AddressSpace> _space;

@@ -260,15 +260,19 @@ void MWLinuxHost::forEachImage(task_t task, const std::function<void(const MWIma
     }
 }
 
-void MWLinuxHost::beginOwnedVmObjectSurvey() {
+void MWLinuxHost::beginSurvey() {
     _forgetListed();
     _run.begin();
 }
 
-void MWLinuxHost::surveyOwnedVmObjects(task_t task) {
+void MWLinuxHost::surveyTask(task_t task, bool withOwnedVmObjects) {
     if (LinuxTask* record = _task(task)) {
-        record->survey();
+        record->survey(withOwnedVmObjects);
     }
+}
+
+void MWLinuxHost::surveySavedProcess() {
+    _run.forkCensus.addSaved();
 }
 
 // An 8-byte count, then the records.

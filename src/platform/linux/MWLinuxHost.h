@@ -64,8 +64,9 @@ public:
     int ledgerTemplate(std::span<ledger_template_info> records, size_t& filled) override;
     int ledgerEntries(int32_t pid, std::span<ledger_entry_info> records, size_t& filled) override;
 
-    void beginOwnedVmObjectSurvey() override;
-    void surveyOwnedVmObjects(task_t task) override;
+    void beginSurvey() override;
+    void surveyTask(task_t task, bool withOwnedVmObjects) override;
+    void surveySavedProcess() override;
     /// What the process holds through descriptors, and its SysV segments that nobody has attached.
     int sysctlOwnedVmObjects(task_t task, std::span<std::byte> reply, size_t& length) override;
     int sysctlSelfRegionMemweight(int32_t& value) override;

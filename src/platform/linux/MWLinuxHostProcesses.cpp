@@ -139,7 +139,6 @@ std::optional<procfs::ProcStat> MWLinuxHost::_statOfPid(int32_t pid) {
 int MWLinuxHost::proc_listallpids(std::span<int32_t> pids) {
     if (pids.empty()) {
         _forgetListed();
-        _run.forkCensus.forgetKernelThreads();
     }
     // Whoever asks for the number asks for the pids next.
     const std::lock_guard lock(_listedMutex);
@@ -183,9 +182,6 @@ int MWLinuxHost::proc_pidinfo(int32_t pid, proc_bsdinfo& record) {
     std::string text;
     const auto stat = directory >= 0 && procfs::readRecord(directory, "stat", text) ? procfs::parseStat(text)
                                                                                     : std::nullopt;
-    if (stat && stat->isKernelThread()) {
-        _run.forkCensus.addKernelThread(pid);
-    }
     if (!stat || stat->isKernelThread()) {
         return noSuchProcess();
     }

@@ -105,8 +105,9 @@ bool markShared(std::vector<BackedVma>& vmas, const CountedProcess& process) {
 
 }  // namespace
 
-std::optional<MappingCounts> countWithoutSmaps(std::vector<BackedVma>& vmas, const CountedProcess& process,
-                                               UncountedPages& uncounted, ForkCensus& census) {
+std::optional<std::vector<ScannedRange>> countWithoutSmaps(std::vector<BackedVma>& vmas,
+                                                           const CountedProcess& process,
+                                                           UncountedPages& uncounted) {
     if (uncounted.canBeInAnonymousMemory() || !canBeCounted(vmas, process.status, uncounted.isSwapInUse())) {
         return std::nullopt;
     }
@@ -126,9 +127,5 @@ std::optional<MappingCounts> countWithoutSmaps(std::vector<BackedVma>& vmas, con
         !std::ranges::all_of(vmas, isClean)) {
         return std::nullopt;
     }
-    const bool sharesByFork = !census.isAlone(process.pid);
-    if (sharesByFork && !markShared(vmas, process)) {
-        return std::nullopt;
-    }
-    return MappingCounts{.sharesByFork = sharesByFork, .filePages = *std::move(filePages)};
+    return process.isAlone || markShared(vmas, process) ? std::move(filePages) : std::nullopt;
 }

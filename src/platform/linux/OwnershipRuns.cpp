@@ -29,7 +29,7 @@ bool swapIsShared(const procfs::Vma& vma) {
 /// Makes runs of one mapping, window by window.
 class RunMaker {
 public:
-    RunMaker(const OwnershipQuestion& question, FrameGenerations& generations)
+    RunMaker(const OwnershipQuestion& question, FrameGenerations* generations)
         : _question(question), _generations(generations), _runsForAWindow(runsForAWindow(question.vma)) {}
 
     /// The pages of [start, start + entries), which lie in one window; ascending without a gap.
@@ -73,7 +73,7 @@ private:
 
     Ownership _ownership(PagemapEntry entry) const {
         if (entry.swapped()) {
-            return {swapIsShared(_question.vma) ? PageOwner::family : PageOwner::process, 0};
+            return {_ownerOf(!swapIsShared(_question.vma)), 0};
         }
         if (!entry.present()) {
             return {};
@@ -81,7 +81,11 @@ private:
         if (_question.isFileMapping && entry.fileOrShared()) {
             return {PageOwner::object, 0};
         }
-        return {entry.exclusive() ? PageOwner::process : PageOwner::family, 0};
+        return {_ownerOf(entry.exclusive()), 0};
+    }
+
+    PageOwner _ownerOf(bool isExclusive) const {
+        return isExclusive || _question.isAlone ? PageOwner::process : PageOwner::family;
     }
 
     void _assignGenerations(uint64_t start, std::span<const PagemapEntry> entries) {
@@ -99,7 +103,7 @@ private:
             return;
         }
         _frameGenerations.resize(_framePages.size());
-        _generations.assign(window, _framePages, _frameGenerations);
+        _generations->assign(window, _framePages, _frameGenerations);
         for (size_t i = 0; i < _framePages.size(); ++i) {
             _ownerships[_framePositions[i]].generation = _frameGenerations[i];
         }
@@ -193,7 +197,7 @@ private:
     }
 
     const OwnershipQuestion& _question;
-    FrameGenerations& _generations;
+    FrameGenerations* _generations;
     uint64_t _runsForAWindow;
     std::vector<OwnershipRun> _runs;
     // Of the window at hand, kept for their storage.
@@ -208,7 +212,8 @@ private:
 
 // Anonymous memory is read where the counts show pages that others map too. Of a file's private mapping the
 // written pages are told from the file's own only page by page.
-bool needsOwnershipRuns(const procfs::Vma& vma, bool isFileMapping) {
+bool needsOwnershipRuns(const OwnershipQuestion& question) {
+    const procfs::Vma& vma = question.vma;
     if (vma.shared || vma.ksm != 0) {
         return false;
     }
@@ -216,11 +221,9 @@ bool needsOwnershipRuns(const procfs::Vma& vma, bool isFileMapping) {
         return vma.sharedHugetlb != 0 && vma.privateHugetlb != 0;
     }
     const bool written = vma.anonymous != 0 || vma.swap != 0;
-    const bool sharesPages = vma.sharedClean + vma.sharedDirty != 0;
-    if (isFileMapping) {
-        return written && (sharesPages || swapIsShared(vma) || vma.anonymous < vma.rss);
-    }
-    return written && (sharesPages || swapIsShared(vma));
+    const bool sharesPages = vma.sharedClean + vma.sharedDirty != 0 || swapIsShared(vma);
+    const bool ofFamily = !question.isAlone && sharesPages;
+    return written && (ofFamily || (question.isFileMapping && vma.anonymous < vma.rss));
 }
 
 namespace {
@@ -305,7 +308,7 @@ bool addWindows(RunMaker& maker, WindowReader& reader, const procfs::Vma& vma) {
 // Asking for zero pages costs a second walk of the page tables and most mappings have none. That there are
 // some shows by more pages being present than the mapping's count has.
 std::vector<OwnershipRun> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
-                                        FrameGenerations& generations) {
+                                        FrameGenerations* generations) {
     constexpr uint64_t kLargestWithoutKnowingHoles = 64ULL << 30U;
     if (question.vma.size() > kLargestWithoutKnowingHoles && !pages.knowsHoles()) {
         return {};

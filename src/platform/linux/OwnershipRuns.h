@@ -49,11 +49,14 @@ struct OwnershipQuestion {
     const procfs::Vma& vma;
     bool isFileMapping;  ///< pages can belong to an object
     uint64_t pageSize;
+    /// Nobody else of its fork family is measured: written pages are the process's own, whoever maps them
+    /// too.
+    bool isAlone;
 };
 
 /// Whether a mapping holds pages of different owners, as far as its counts tell; reading its pages costs as
 /// much as the counts did.
-bool needsOwnershipRuns(const procfs::Vma& vma, bool isFileMapping);
+bool needsOwnershipRuns(const OwnershipQuestion& question);
 
 /// The maximal spans of one owner. Absent pages go with the page before them; where a window of a family
 /// (MWFamilyWindow) holds no page at all it has no owner, so that nobody looks like its sharer. Family runs
@@ -68,5 +71,7 @@ bool needsOwnershipRuns(const procfs::Vma& vma, bool isFileMapping);
 /// The counts of the runs add up to those of the mapping (`rss`, `swap`), which was counted a moment earlier:
 /// what came or went in between is added to or taken from the largest runs. Empty when the pages cannot be
 /// read, are all gone, or lie in a mapping so large that it cannot be read without knowing its holes.
+///
+/// `generations` are those of the process's family, null when it is alone.
 std::vector<OwnershipRun> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
-                                        FrameGenerations& generations);
+                                        FrameGenerations* generations);
