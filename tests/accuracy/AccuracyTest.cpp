@@ -24,8 +24,6 @@ protected:
 
 namespace {
 
-constexpr uid_t kNobody = 65534;
-
 /// Who measures: root, or a user.
 using User = std::optional<uid_t>;
 

@@ -1,6 +1,7 @@
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
+#include <sys/sysinfo.h>
 #include <sys/utsname.h>
 #include <sys/vfs.h>
 #include <unistd.h>
@@ -9,6 +10,7 @@
 #include <algorithm>
 #include <fstream>
 #include <iterator>
+#include <optional>
 
 #include "accuracy/Measurement.h"
 #include "accuracy/SystemResources.h"
@@ -85,13 +87,24 @@ Comparison compareReadings(const std::vector<pid_t>& pids) {
     return comparison;
 }
 
-/// The same where nobody has lazily freed memory, whoever has.
-Comparison compareAsOnFreshMachine(const std::vector<pid_t>& pids) {
+/// Who compares, and where.
+struct Reader {
+    const char* name;
+    bool onFreshMachine;  ///< where nobody has lazily freed memory, whoever has
+    std::optional<uid_t> user;
+};
+
+Comparison compareAs(const Reader& reader, const std::vector<pid_t>& pids) {
     constexpr size_t kRoom = 1U << 20U;
     void* memory = mmap(nullptr, kRoom, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
     char* text = static_cast<char*>(memory);
     const ChildProcess measuring([&] {
-        coverLazilyFreed();
+        if (reader.onFreshMachine) {
+            coverLazilyFreed();
+        }
+        if (reader.user) {
+            becomeUser(*reader.user);
+        }
         const Comparison comparison = compareReadings(pids);
         comparison.differences.copy(text, kRoom - 1);
         return uint64_t{comparison.counted};
@@ -100,6 +113,15 @@ Comparison compareAsOnFreshMachine(const std::vector<pid_t>& pids) {
     munmap(memory, kRoom);
     return comparison;
 }
+
+bool isSwapInUse() {
+    struct sysinfo system = {};
+    sysinfo(&system);
+    return system.freeswap != system.totalswap;
+}
+
+/// Where a scenario's processes are read without smaps.
+enum class Counted : uint8_t { nowhere, onFreshMachine, everywhere };
 
 }  // namespace
 
@@ -110,29 +132,41 @@ TEST(Readings, GiveTheFiguresThatSmapsGives) {
     const auto disk = temporaryDirectory("/var/tmp");
     const auto memory = temporaryDirectory("/dev/shm");
     const std::string file = *disk / "file";
+    const std::string smallFile = *disk / "small-file";
+    const std::filesystem::path memoryFile = *memory / "file";
     writeCleanFile(file, 20);
+    writeCleanFile(smallFile, 6);
+    for (const std::filesystem::path& writtenByAll : {*memory, std::filesystem::path(file)}) {
+        std::filesystem::permissions(writtenByAll, std::filesystem::perms::all);
+    }
     sync();  // pages of a program that was just built are dirty
-    const std::string sharedObjects = "shared-objects 8 10 " + file + " " + (*memory / "file").string();
+    const std::string sharedObjects = "shared-objects 8 10 " + file + " " + memoryFile.string();
     // None of a size that could be an arena's, which needs the flags of smaps; nor do they have to do without
     // where they can write to a file or have the stack of a thread.
-    for (const auto& [scenario, isCounted] : std::vector<std::pair<std::string, bool>>{
-             {"plain 17", true},
-             {"fork-tree 20 16 1 0", true},
-             {"fork-tree 40 3 3 9", true},
-             {"private-file " + file + " 8", true},
-             {"private-file " + file + " 0", true},
-             {"touched-between-forks 20 9", true},
-             {"descendants 24", true},
-             {"alternating 40 1", true},
-             {"orphans-of-exec 3 16", true},
-             {"one-address-space 20", true},
-             {sharedObjects, false},
-             {"without-first-thread 20", false},
+    for (const auto& [scenario, counted] : std::vector<std::pair<std::string, Counted>>{
+             {"plain 17", Counted::everywhere},
+             {"fork-tree 10 9 1 0", Counted::everywhere},
+             {"fork-tree 40 3 3 9", Counted::onFreshMachine},
+             {"private-file " + smallFile + " 8", Counted::everywhere},
+             {"private-file " + file + " 0", Counted::onFreshMachine},
+             {"touched-between-forks 20 9", Counted::onFreshMachine},
+             {"descendants 24", Counted::onFreshMachine},
+             {"alternating 40 1", Counted::onFreshMachine},
+             {"orphans-of-exec 3 16", Counted::onFreshMachine},
+             {"one-address-space 20", Counted::onFreshMachine},
+             {sharedObjects, Counted::nowhere},
+             {"without-first-thread 20", Counted::nowhere},
          }) {
-        const Workload workload(scenario);
-        const Comparison comparison = compareAsOnFreshMachine(workload.pids());
-        EXPECT_EQ(comparison.differences, "") << scenario;
-        EXPECT_TRUE(!isCounted || comparison.counted == workload.pids().size())
-            << scenario << ": smaps was read of all but " << comparison.counted;
+        for (const Reader& reader : {Reader{"root, fresh machine", true, {}}, Reader{"root", false, {}},
+                                     Reader{"an ordinary user", false, kNobody}}) {
+            std::filesystem::remove(memoryFile);
+            const Workload workload(scenario, {.user = reader.user});
+            const Comparison comparison = compareAs(reader, workload.pids());
+            EXPECT_EQ(comparison.differences, "") << scenario << ", " << reader.name;
+            const bool isCounted = reader.onFreshMachine ? counted != Counted::nowhere
+                                                         : counted == Counted::everywhere && !isSwapInUse();
+            EXPECT_TRUE(!isCounted || comparison.counted == workload.pids().size())
+                << scenario << ", " << reader.name << ": smaps was read of all but " << comparison.counted;
+        }
     }
 }

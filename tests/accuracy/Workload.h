@@ -36,6 +36,9 @@ private:
     std::map<std::string, pid_t> _pids;
 };
 
+/// An ordinary user.
+inline constexpr uid_t kNobody = 65534;
+
 /// Gives up root for good: user and group `user`, no groups, no capabilities; the process can still look at
 /// itself.
 void becomeUser(uid_t user);

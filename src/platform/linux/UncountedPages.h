@@ -11,8 +11,8 @@
 #include "platform/linux/BackedVma.h"
 
 /// Whether there can be pages that only smaps tells from others: those given up with MADV_FREE, those merged
-/// with equal ones, and the dirty ones of a file. Most machines and most files have none, which can be seen
-/// without asking each process. Needs root. Safe for use from several threads.
+/// with equal ones, and the dirty ones of a file. Many machines and most files have none, which can be seen
+/// without asking each process; of files by root alone. Safe for use from several threads.
 class UncountedPages {
 public:
     /// `proc` is a descriptor of /proc; `mergedPages` the path where the kernel says how many pages it has

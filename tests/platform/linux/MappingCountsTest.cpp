@@ -22,6 +22,7 @@ struct Measured {
     bool hasFork = false;
     bool canReadPages = true;
     bool canScan = true;
+    std::string sums = {};  ///< what smaps_rollup says behind its first line; nothing where there is none
 
     WrittenMapping& data() { return mappings[1]; }
     WrittenMapping& anonymous() { return mappings[2]; }
@@ -53,6 +54,10 @@ protected:
             bool readPages(uint64_t, std::span<PagemapEntry>) override { return false; }
         };
         process.emplace(measured.mappings);
+        std::filesystem::remove(place("20/smaps_rollup"));
+        if (!measured.sums.empty()) {
+            write("20/smaps_rollup", "1000-7ffff000 ---p 00000000 00:00 0 [rollup]\n" + measured.sums);
+        }
         const procfs::Descriptor proc = directory("");
         const procfs::Descriptor memory = directory("20");
         UncountedPages uncounted(proc.get(), _top + "/pages_shared");
@@ -157,8 +162,36 @@ TEST_F(MappingCountsTest, DeclinesWhereSmapsTellsMore) {
         with({90020, "F.F", Backing::shmem, "rw-s", path})(measured);
         EXPECT_EQ(isCounted(measured), !isSwapInUse) << path << ": what of it is in swap cannot be seen";
     }
+}
+
+TEST_F(MappingCountsTest, SumsOfTheProcessTellWhatIsNotKnownOfTheSystem) {
+    const std::string clean = "Private_Dirty: 20 kB\nAnonymous: 24 kB\n";
+    const std::string dirty = "Shared_Dirty: 4 kB\nPrivate_Dirty: 20 kB\nAnonymous: 20 kB\n";
+    const auto isCountedWith = [this](const std::string& sums, const WrittenMapping& more = {80, "."}) {
+        Measured measured = plainProcess();
+        measured.sums = sums;
+        measured.mappings.insert(measured.mappings.begin() + 3, more);
+        return isCounted(measured);
+    };
+    const WrittenMapping goneFile = {80, "F", Backing::file, "rw-p", "/lib/y"};
+    ASSERT_TRUE(isCountedWith(""));
+    EXPECT_EQ(isCountedWith(clean, goneFile), !isSwapInUse) << "its pages cannot be asked about";
+    EXPECT_FALSE(isCountedWith(dirty, goneFile));
+    EXPECT_TRUE(isCountedWith(dirty)) << "the file's page that was dirty is not any more";
+
     write("vmstat", "pglazyfree 1\n");
-    EXPECT_FALSE(isCounted(plainProcess())) << "any page can be a lazily freed one";
+    EXPECT_FALSE(isCountedWith("")) << "any page can be a lazily freed one";
+    EXPECT_TRUE(isCountedWith(clean));
+    EXPECT_TRUE(isCountedWith(dirty)) << "files are asked about as ever";
+    EXPECT_FALSE(isCountedWith(clean + "LazyFree: 4 kB\n"));
+    EXPECT_FALSE(isCountedWith(clean + "KSM: 4 kB\n"));
+    EXPECT_EQ(isCountedWith(clean, goneFile), !isSwapInUse);
+    EXPECT_FALSE(isCountedWith("VmFlags: rd\n")) << "no counts";
+
+    Measured large = plainProcess();
+    large.sums = clean;
+    large.status.rssAnon = 3U << 20U;
+    EXPECT_FALSE(isCounted(large)) << "five mappings are not worth a look at 768 pages more";
 }
 
 }  // namespace
