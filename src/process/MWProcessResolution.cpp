@@ -88,20 +88,22 @@ std::vector<Record> recordsOfPids(const std::vector<int32_t>& pids) {
         [&](size_t index) { return recordOfPidAlone(pids[index]); });
 }
 
-/// Every process there is now, in the order of the system's list; null when there is no telling.
-std::shared_ptr<const ProcessSnapshot> takeSnapshot() {
-    const auto pids = listAllPids();
-    if (!pids) {
-        return nullptr;
-    }
+/// The processes of those of the pids that are there, in their order; null when none is.
+std::shared_ptr<const ProcessSnapshot> snapshotOf(const std::vector<int32_t>& pids) {
     auto snapshot = std::make_shared<ProcessSnapshot>();
-    snapshot->reserve(pids->size());
-    for (const Record& record : recordsOfPids(*pids)) {
+    snapshot->reserve(pids.size());
+    for (const Record& record : recordsOfPids(pids)) {
         if (record) {
             snapshot->push_back(*record);
         }
     }
     return snapshot->empty() ? nullptr : std::move(snapshot);
+}
+
+/// Every process there is now, in the order of the system's list; null when there is no telling.
+std::shared_ptr<const ProcessSnapshot> takeSnapshot() {
+    const auto pids = listAllPids();
+    return pids ? snapshotOf(*pids) : nullptr;
 }
 
 int32_t pidOf(const proc_bsdinfo& info) {
@@ -205,6 +207,29 @@ private:
     std::vector<std::string> _names;
 };
 
+/// As much of the system's list as matching the descriptions meets: the walk for a pid ends at that process.
+/// Null when there is no telling.
+std::shared_ptr<const ProcessSnapshot> takeSnapshotFor(const std::vector<std::string>& descriptions) {
+    const auto pids = listAllPids();
+    if (!pids) {
+        return nullptr;
+    }
+    auto last = pids->begin();
+    for (const std::string& description : descriptions) {
+        const auto met = std::ranges::find(*pids, leadingInteger(description));
+        if (met == pids->end()) {
+            return snapshotOf(*pids);
+        }
+        last = std::max(last, met + 1);
+    }
+    const auto snapshot = snapshotOf({pids->begin(), last});
+    const bool meetsAll =
+        snapshot && std::ranges::all_of(descriptions, [&](const std::string& description) {
+            return std::ranges::find(*snapshot, leadingInteger(description), pidOf) != snapshot->end();
+        });
+    return meetsAll ? snapshot : snapshotOf(*pids);
+}
+
 /// Parent to the places of its children in the snapshot.
 using ChildrenByParent = std::unordered_map<int32_t, std::vector<size_t>>;
 
@@ -295,7 +320,7 @@ std::optional<MWPidMap> MWProcess::pidsForStringDescriptions(const std::vector<s
             errors->push_back(std::move(message));
         }
     };
-    const auto snapshot = takeSnapshot();
+    const auto snapshot = takeSnapshotFor(descriptions);
     if (!snapshot) {
         addError("Unable to obtain system process list");
         return std::nullopt;

@@ -63,6 +63,22 @@ TEST(MWProcessResolutionTest, MatchesDescriptionsByNameAndPid) {
     }
 }
 
+// The walk for a pid ends there, so that nobody has to be asked about those behind it.
+TEST(MWProcessResolutionTest, LooksAtNoProcessBehindTheLastThatIsDescribed) {
+    FakeHost host;
+    for (const int32_t pid : {10, 11, 12, 13, 14}) {
+        host.processes[pid] = {.executable = "/bin/shell"};
+    }
+    host.processes[14].executable = "/bin/12";
+    EXPECT_EQ(MWProcess::pidsForStringDescriptions({"12", "11"}, nullptr),
+              (MWPidMap{{11, std::nullopt}, {12, std::nullopt}}));
+    EXPECT_EQ(host.asked("proc_pidinfo.full"), 3);
+    host.processes[12].gone = true;
+    EXPECT_EQ(MWProcess::pidsForStringDescriptions({"12", "11"}, nullptr),
+              (MWPidMap{{11, std::nullopt}, {14, "12"}}))
+        << "it was listed and is no process: the walk goes on";
+}
+
 // 0 ─┬─ 1 ─┬─ 40 ── 3
 //    │     └─ 41 ── 2
 //    └─ 50             0 and 51 are their own parents
