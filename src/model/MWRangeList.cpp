@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <array>
+#include <iterator>
 #include <utility>
 
 #include "model/MWMemoryRegion.h"
@@ -70,6 +71,10 @@ void absorb(MWRangeListNode& added, const MWRangeListNode& node, uint64_t overla
     added.start = start;
 }
 
+bool liesBefore(const MWRangeListNode& node, uint64_t firstPage, uint64_t pageSize) {
+    return pagesOf(node, pageSize).end < firstPage;
+}
+
 }  // namespace
 
 MWRangeList::~MWRangeList() {
@@ -90,28 +95,57 @@ void MWRangeList::addRange(MWSubrange range, uint64_t pageSize, const MWCategory
                              .reclaimable = memoryTotal.reclaimable,
                              .wired = memoryTotal.wired};
 
-    MWRangeListNode*& link = _linkBehindNodesBefore(pages.first, page);
+    MWRangeListNode*& link = _linkBehindNodesBefore(span.start, page);
     while (link != nullptr && pagesOf(*link, page).first <= pages.end) {
         absorb(added, *link, overlapInBytes(pages, pagesOf(*link, page), page));
+        if (_index) {
+            _index->erase(link->start);
+        }
         delete std::exchange(link, link->next);
     }
     added.next = link;
     link = new MWRangeListNode(added);
+    if (_index) {
+        _index->emplace(link->start, link);
+    }
 }
 
-MWRangeListNode*& MWRangeList::_linkBehindNodesBefore(uint64_t firstPage, uint64_t pageSize) {
-    const auto liesBefore = [=](const MWRangeListNode* node) {
-        return node != nullptr && pagesOf(*node, pageSize).end < firstPage;
-    };
-    if (!liesBefore(_lastPredecessor)) {
+MWRangeListNode*& MWRangeList::_linkBehindNodesBefore(uint64_t start, uint64_t pageSize) {
+    constexpr size_t kLongWalk = 64;
+    if (_index) {
+        return _linkByIndex(start, pageSize);
+    }
+    const uint64_t firstPage = start / pageSize;
+    if (_lastPredecessor != nullptr && !liesBefore(*_lastPredecessor, firstPage, pageSize)) {
         _lastPredecessor = nullptr;
     }
     MWRangeListNode** link = _lastPredecessor == nullptr ? &_rangeListHead : &_lastPredecessor->next;
-    while (liesBefore(*link)) {
+    for (size_t steps = 0; *link != nullptr && liesBefore(**link, firstPage, pageSize); ++steps) {
+        if (steps == kLongWalk) {
+            _makeIndex();
+            return _linkByIndex(start, pageSize);
+        }
         _lastPredecessor = *link;
         link = &_lastPredecessor->next;
     }
     return *link;
+}
+
+void MWRangeList::_makeIndex() {
+    _index = std::make_unique<Index>();
+    for (MWRangeListNode* node = _rangeListHead; node != nullptr; node = node->next) {
+        _index->emplace_hint(_index->end(), node->start, node);
+    }
+}
+
+// What begins behind the span's start does not lie before it; of what begins in front, only nodes that will
+// be absorbed do not.
+MWRangeListNode*& MWRangeList::_linkByIndex(uint64_t start, uint64_t pageSize) {
+    auto place = _index->lower_bound(start);
+    while (place != _index->begin() && !liesBefore(*std::prev(place)->second, start / pageSize, pageSize)) {
+        --place;
+    }
+    return place == _index->begin() ? _rangeListHead : std::prev(place)->second->next;
 }
 
 void MWRangeList::addRegion(const MWMemoryRegion& region, uint64_t pageSize) {

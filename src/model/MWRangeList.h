@@ -1,6 +1,8 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
+#include <memory>
 
 #include "model/MWCategoryTotals.h"
 
@@ -43,8 +45,8 @@ public:
     MWRangeList& operator=(const MWRangeList&) = delete;
 
     /// `memoryTotal.regions` is ignored. A page size of 0, as a damaged snapshot may have, rounds nothing.
-    /// Costs the walk to the span's place: constant when spans come in ascending order, else up to the whole
-    /// list.
+    /// Costs the walk to the span's place: constant when spans come in ascending order, else the logarithm of
+    /// the list.
     void addRange(MWSubrange range, uint64_t pageSize, const MWCategoryTotals& memoryTotal);
     /// The region's sub-ranges when it has them, else its whole span of its object.
     void addRegion(const MWMemoryRegion& region, uint64_t pageSize);
@@ -57,12 +59,20 @@ public:
     const MWRangeListNode* head() const { return _rangeListHead; }
 
 private:
-    /// The link (head or `next`) behind the last node that ends before `firstPage` without touching it.
-    MWRangeListNode*& _linkBehindNodesBefore(uint64_t firstPage, uint64_t pageSize);
+    using Index = std::map<uint64_t, MWRangeListNode*>;
+
+    /// The link (head or `next`) behind the last node that ends before the span's first page without touching
+    /// it.
+    MWRangeListNode*& _linkBehindNodesBefore(uint64_t start, uint64_t pageSize);
+    MWRangeListNode*& _linkByIndex(uint64_t start, uint64_t pageSize);
+    void _makeIndex();
 
     MWRangeListNode* _rangeListHead = nullptr;
     /// The node before the last added one, none at the head. A later span that it also lies before is placed
     /// from here, since all nodes in front of it lie before that span too. An addition frees no node up to
     /// it.
     MWRangeListNode* _lastPredecessor = nullptr;
+    /// All nodes by start, once a walk was long. Few lists have more than some nodes, and most of those grow
+    /// at their end.
+    std::unique_ptr<Index> _index;
 };
