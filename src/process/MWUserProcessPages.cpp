@@ -59,18 +59,24 @@ SubrangeKind kindOfPage(int32_t word, int32_t reclaimableMask) {
     return (word & VM_PAGE_QUERY_PAGE_PRESENT) != 0 ? SubrangeKind::clean : SubrangeKind::absent;
 }
 
+/// The first word behind `begin` that is another.
+template <class Iterator>
+Iterator endOfEqual(Iterator begin, Iterator end) {
+    return std::find_if(begin, end, [=](int32_t word) { return word != *begin; });
+}
+
 /// Joins consecutive pages of one kind into runs, each a sub-range of the region.
 class SubrangeRuns {
 public:
     SubrangeRuns(MWMemoryRegion& region, uint64_t pageSize)
         : _region(region), _pageSize(pageSize), _offset(region.offset()) {}
 
-    void addPage(SubrangeKind kind) {
+    void addPages(SubrangeKind kind, uint64_t count) {
         if (kind != _kind) {
             close();
             _kind = kind;
         }
-        (kind == SubrangeKind::absent ? _offset : _length) += _pageSize;
+        (kind == SubrangeKind::absent ? _offset : _length) += count * _pageSize;
     }
 
     void close() {
@@ -215,8 +221,11 @@ void MWUserProcess::_addSubrangesForRegion(MWMemoryRegion& region, int32_t purge
     SubrangeRuns runs(region, pageSize());
     const bool complete = _enumerateDispositionChunksWithStartAddr(
         span.firstPage, {.pagesToQuery = span.pages, .block = [&](const MWDispositionChunk& chunk) {
-                             for (const int32_t word : chunk.words) {
-                                 runs.addPage(kindOfPage(word, reclaimableMask));
+                             for (auto word = chunk.words.begin(); word != chunk.words.end();) {
+                                 const auto end = endOfEqual(word, chunk.words.end());
+                                 runs.addPages(kindOfPage(*word, reclaimableMask),
+                                               static_cast<uint64_t>(end - word));
+                                 word = end;
                              }
                          }});
     if (complete) {

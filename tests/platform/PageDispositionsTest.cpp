@@ -86,6 +86,14 @@ TEST(PageDispositions, SwappedShmemLooksAbsent) {
     region.info.pages_swapped_out = 1;
     EXPECT_EQ(words(pages, region, 0x10000, {absent, file(), absent}, none), (Words{kPagedOut, kDirty, 0}));
     EXPECT_EQ(words(pages, regionOf(Backing::file), 0x10000, {absent}, none), (Words{0}));
+
+    region.info.pages_swapped_out = 4;
+    Words hole(3);
+    pages.fillHole(region, region.start, kPage, hole);
+    EXPECT_EQ(hole, (Words{kPagedOut, kPagedOut, kPagedOut}));
+    const uint64_t behind = region.start + 3 * kPage;
+    EXPECT_EQ(words(pages, region, behind, {file(), absent, absent}, none), (Words{kDirty, kPagedOut, 0}))
+        << "the count goes on behind a hole";
 }
 
 TEST(PageDispositions, FrameFlagsSayWhichPagesTheyAre) {

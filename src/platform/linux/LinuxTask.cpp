@@ -347,18 +347,17 @@ void LinuxTask::dropSnapshot() {
     _holeStart = _holeEnd = 0;
 }
 
-// The pages from `address` on, as many as there are entries, all of them in the region. A file of a terabyte
-// of which three pages are mapped is asked about only where it has some.
+// A file of a terabyte of which three pages are mapped is asked about only where it has some.
+bool LinuxTask::_isHole(const AddressSpaceRegion& region, uint64_t start, uint64_t end) {
+    if (region.isSparse(_run.pageSize) && (start < _holeStart || start >= _holeEnd)) {
+        _holeStart = start;
+        _holeEnd = _pages->nextPopulated(start, region.end());
+    }
+    return start >= _holeStart && end <= _holeEnd;
+}
+
+// The pages from `address` on, as many as there are entries, all of them in the region.
 bool LinuxTask::_readEntries(const AddressSpaceRegion& region, uint64_t address) {
-    const uint64_t end = address + _entries.size() * _run.pageSize;
-    if (region.isSparse(_run.pageSize) && (address < _holeStart || address >= _holeEnd)) {
-        _holeStart = address;
-        _holeEnd = _pages->nextPopulated(address, region.end());
-    }
-    if (address >= _holeStart && end <= _holeEnd) {
-        std::fill(_entries.begin(), _entries.end(), PagemapEntry{});
-        return true;
-    }
     if (!_pages->readPages(address, _entries)) {
         return false;
     }
@@ -375,12 +374,18 @@ kern_return_t LinuxTask::fillDispositions(uint64_t start, std::span<int32_t> wor
     const AddressSpaceRegion* const last = _space->regions().data() + _space->regions().size();
     for (; region != nullptr && region != last && region->start < end; ++region) {
         const uint64_t from = std::max(start, region->start);
-        _entries.resize((std::min(end, region->end()) - from) / _run.pageSize);
+        const uint64_t to = std::min(end, region->end());
+        const uint64_t pages = (to - from) / _run.pageSize;
+        const auto wordsOfPart = words.subspan((from - start) / _run.pageSize, pages);
+        if (_isHole(*region, from, to)) {
+            _dispositions.fillHole(*region, from, _run.pageSize, wordsOfPart);
+            continue;
+        }
+        _entries.resize(pages);
         if (!_readEntries(*region, from)) {
             return KERN_INVALID_ARGUMENT;
         }
-        _dispositions.fill(*region, from, _entries, _run.frames, _run.pageSize,
-                           words.subspan((from - start) / _run.pageSize));
+        _dispositions.fill(*region, from, _entries, _run.frames, _run.pageSize, wordsOfPart);
     }
     return KERN_SUCCESS;
 }

@@ -140,6 +140,7 @@ private:
     bool _countsPayOff(const procfs::ProcStatus& status) const;
     bool _runsTheSame();
     std::unordered_set<uint64_t> _shownObjects();
+    bool _isHole(const AddressSpaceRegion& region, uint64_t start, uint64_t end);
     bool _readEntries(const AddressSpaceRegion& region, uint64_t address);
     SharedAddressSpaces::Candidate _candidate() const {
         return {{_pid, _startTime}, _threadId, _stat.startStack};

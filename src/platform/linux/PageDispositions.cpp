@@ -16,16 +16,30 @@ bool takePage(uint64_t& bytesLeft, uint64_t pageSize) {
 void PageDispositions::fill(const AddressSpaceRegion& region, uint64_t address,
                             std::span<const PagemapEntry> entries, const PageFrameFlags& frames,
                             uint64_t pageSize, std::span<int32_t> words) {
+    _goOnAt(region, address, pageSize);
+    for (size_t page = 0; page < entries.size(); ++page) {
+        words[page] = _word(region, entries[page], frames, pageSize);
+    }
+    _next = address + entries.size() * pageSize;
+}
+
+void PageDispositions::fillHole(const AddressSpaceRegion& region, uint64_t address, uint64_t pageSize,
+                                std::span<int32_t> words) {
+    _goOnAt(region, address, pageSize);
+    for (auto word = words.begin(); word != words.end() && takePage(_swappedShmemBytesLeft, pageSize);
+         ++word) {
+        *word = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    }
+    _next = address + words.size() * pageSize;
+}
+
+void PageDispositions::_goOnAt(const AddressSpaceRegion& region, uint64_t address, uint64_t pageSize) {
     if (address != _next || address == region.start) {
         _dirtyFileBytesLeft = region.dirtyFileBytes;
         _lazilyFreedBytesLeft = region.lazilyFreedBytes;
         _swappedShmemBytesLeft =
             region.backing == Backing::shmem ? region.info.pages_swapped_out * pageSize : 0;
     }
-    for (size_t page = 0; page < entries.size(); ++page) {
-        words[page] = _word(region, entries[page], frames, pageSize);
-    }
-    _next = address + entries.size() * pageSize;
 }
 
 int32_t PageDispositions::_word(const AddressSpaceRegion& region, PagemapEntry entry,

@@ -22,8 +22,12 @@ public:
     /// that does not go on where the last one ended begins counting anew.
     void fill(const AddressSpaceRegion& region, uint64_t address, std::span<const PagemapEntry> entries,
               const PageFrameFlags& frames, uint64_t pageSize, std::span<int32_t> words);
+    /// The same where no page is present. The words are 0.
+    void fillHole(const AddressSpaceRegion& region, uint64_t address, uint64_t pageSize,
+                  std::span<int32_t> words);
 
 private:
+    void _goOnAt(const AddressSpaceRegion& region, uint64_t address, uint64_t pageSize);
     int32_t _word(const AddressSpaceRegion& region, PagemapEntry entry, const PageFrameFlags& frames,
                   uint64_t pageSize);
     bool _isDirtyFilePage(uint64_t flags, bool flagsKnown, uint64_t pageSize);
