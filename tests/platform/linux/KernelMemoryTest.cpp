@@ -123,35 +123,16 @@ std::string tagSite(MWKernelTag tag) {
 TEST_F(KernelTexts, CachesAreZonesAndTheRestOfTheTotalIsTooLargeForAny) {
     writeMeminfo();
     writeSlabinfo(
-        "ext4_inode_cache     100    110   1000   10    2 : tunables    0    0    0 : slabdata     11     11 "
-        "  "
-        "   0\n"
-        "kmalloc-64          5000   6400     64   64    1 : tunables    0    0    0 : slabdata    100    100 "
-        "  "
-        "   0\n"
-        "dentry               900   1000    192   21    1 : tunables    0    0    0 : slabdata     50     50 "
-        "  "
-        "   0\n"
-        "a name of words        7      8    512    8    1 : tunables    0    0    0 : slabdata      1      1 "
-        "  "
-        "   0\n"
-        "full               99999   1000   4096    8    8 : tunables    0    0    0 : slabdata      1      1 "
-        "  "
-        "   0\n"
-        "nothing                1      1      0    1    1 : tunables    0    0    0 : slabdata      1      1 "
-        "  "
-        "   0\n"
-        "radix_tree_node        1      1     64   64    1 : tunables    0    0    0 : slabdata      1      1 "
-        "  "
-        "   0\n"
-        "kmalloc-rcl-64         1      1     64   64    1 : tunables    0    0    0 : slabdata      1      1 "
-        "  "
-        "   0\n"
-        "endless                1      1     64   64    1 : tunables    0    0    0 : slabdata      1 "
-        "18446744073709551615      0\n"
-        "empty                  0      0     64   64    1 : tunables    0    0    0 : slabdata      0      0 "
-        "  "
-        "   0\n");
+        "ext4_inode_cache  100 110 1000 10 2 : tunables 0 0 0 : slabdata 11 11 0\n"
+        "kmalloc-64        5000 6400 64 64 1 : tunables 0 0 0 : slabdata 100 100 0\n"
+        "dentry            900 1000 192 21 1 : tunables 0 0 0 : slabdata 50 50 0\n"
+        "a name of words   7 8 512 8 1 : tunables 0 0 0 : slabdata 1 1 0\n"
+        "full              99999 1000 4096 8 8 : tunables 0 0 0 : slabdata 1 1 0\n"
+        "nothing           1 1 0 1 1 : tunables 0 0 0 : slabdata 1 1 0\n"
+        "radix_tree_node   1 1 64 64 1 : tunables 0 0 0 : slabdata 1 1 0\n"
+        "kmalloc-rcl-64    1 1 64 64 1 : tunables 0 0 0 : slabdata 1 1 0\n"
+        "endless           1 1 64 64 1 : tunables 0 0 0 : slabdata 1 18446744073709551615 0\n"
+        "empty             0 0 64 64 1 : tunables 0 0 0 : slabdata 0 0 0\n");
     write("sysfs/kernel/slab/kmalloc-64/reclaim_account", "0\n");
     write("sysfs/kernel/slab/full/reclaim_account", "1\n");
     const Answer answer = ask();
