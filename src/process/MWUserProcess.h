@@ -82,7 +82,7 @@ public:
     MWUserProcess(const MWUserProcess&) = delete;
     MWUserProcess& operator=(const MWUserProcess&) = delete;
 
-    /// Has the host look at what the process owns, where it will be asked for it.
+    /// Announces the process to the host, with what it owns where it will be asked for that.
     void prepareToGatherData() override;
     bool takesLongToGather() const override { return _physMemweight >= kLargeProcess; }
     /// Does nothing for a process that has its regions.

@@ -16,7 +16,6 @@ MWAuxDatum bytesOfOneProcess(uint64_t bytes) {
     return std::make_shared<const MWAuxData>(static_cast<int64_t>(bytes), false);
 }
 
-/// None when the reply is shorter than it says.
 /// A reply that is shorter than it says, which no kernel gives, lists nothing.
 MWOwnedObjects ownedObjectsOfReply(std::span<const std::byte> reply) {
     uint64_t count = 0;
@@ -80,7 +79,8 @@ bool MWUserProcess::_asksForOwnedVmObjects() const {
     return _task && !hiddenFromDisplay() && MWPhysMemweightSwitch::isOn();
 }
 
-// Also one that is gathered already: what it holds is not to be charged to another.
+// Also one that is gathered already: what it holds is not to be charged to another, and who shares memory
+// with it is not alone.
 void MWUserProcess::prepareToGatherData() {
     if (_task && _isAlive()) {
         MWHostInterface::current().surveyTask(*_task, _asksForOwnedVmObjects());

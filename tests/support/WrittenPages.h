@@ -13,13 +13,14 @@ class WrittenPages : public PageSource {
 public:
     std::map<uint64_t, PagemapEntry> pages;
     std::set<uint64_t> zeroPages;
+    bool canBeRead = true;
 
     bool readPages(uint64_t address, std::span<PagemapEntry> entries) override {
         for (PagemapEntry& entry : entries) {
             entry = pages.contains(address) ? pages.at(address) : PagemapEntry{};
             address += 4096;
         }
-        return true;
+        return canBeRead;
     }
     void clearZeroPages(uint64_t address, std::span<PagemapEntry> entries) override {
         for (PagemapEntry& entry : entries) {

@@ -138,11 +138,12 @@ public:
                                             .pageSize = _context.pageSize,
                                             .isAlone = !_owner.family};
         if (backed.backing != Backing::special && needsOwnershipRuns(question)) {
-            const std::vector<OwnershipRun> runs =
+            const auto runs =
                 ownershipRuns(question, _pages, question.isAlone ? nullptr : &_family().generations());
-            if (!runs.empty()) {
-                _addRuns(backed, {.tag = tag, .file = _fileOf(backed, image)}, runs);
-                _partOfFamilyMemory += _partOf(backed, runs);
+            _missesPages |= !runs.has_value();
+            if (runs && !runs->empty()) {
+                _addRuns(backed, {.tag = tag, .file = _fileOf(backed, image)}, *runs);
+                _partOfFamilyMemory += _partOf(backed, *runs);
                 return;
             }
         }
@@ -150,6 +151,7 @@ public:
     }
 
     uint64_t partOfFamilyMemory() const { return _partOfFamilyMemory; }
+    bool missesPages() const { return _missesPages; }
 
 private:
     /// What tells the memory of one window apart: each use of it has a name of its own, so it is an object of
@@ -198,18 +200,16 @@ private:
         _regions.push_back(std::move(region));
     }
 
-    // Lazily freed pages that are still shared count as dirty: they cannot be taken while another process has
-    // them. How many of a mapping's lazily freed pages and of its dirty file pages lie in which run is not
-    // known; the first runs are taken.
+    // The kernel takes lazily freed pages from all who share them. How many of a mapping's lazily freed pages
+    // and of its dirty file pages lie in which run is not known; the first runs are taken.
     void _addRuns(const BackedVma& backed, const Use& use, const std::vector<OwnershipRun>& runs) {
         uint64_t lazilyFreed = backed.vma.lazyFree / _context.pageSize;
         uint64_t dirtyFile = dirtyFileBytes(backed.vma) / _context.pageSize;
         for (const OwnershipRun& run : runs) {
             _regions.push_back(_regionOfRun(backed, use, run));
-            const bool isOwn = run.owner == PageOwner::process;
             const bool isObject = run.owner == PageOwner::object;
             _count(_regions.back(), run,
-                   {.reusable = isOwn ? takeUpTo(lazilyFreed, run.resident) : 0,
+                   {.reusable = isWritten(run.owner) ? takeUpTo(lazilyFreed, run.resident) : 0,
                     .dirtyFile = isObject ? takeUpTo(dirtyFile, run.resident) : 0});
         }
     }
@@ -309,6 +309,7 @@ private:
     std::vector<AddressSpaceRegion>& _regions;
     ForkFamily* _knownFamily = nullptr;
     uint64_t _partOfFamilyMemory = 0;
+    bool _missesPages = false;
 };
 
 }  // namespace
@@ -380,6 +381,7 @@ AddressSpace::AddressSpace(const std::vector<BackedVma>& backed, const AddressSp
     }
     _images = std::move(images.images);
     _partOfFamilyMemory = builder.partOfFamilyMemory();
+    _missesPages = builder.missesPages();
 }
 
 const AddressSpaceRegion* AddressSpace::regionAtOrAbove(uint64_t address) const {

@@ -67,6 +67,9 @@ public:
     /// The process's part of the memory that its fork family shares, in bytes, each divided by the number of
     /// processes that map it; 0 when it shares none.
     uint64_t partOfFamilyMemory() const { return _partOfFamilyMemory; }
+    /// Whether pages of a mapping that needs a look at them could not be read: it is one region then, in
+    /// whole the process's own.
+    bool missesPages() const { return _missesPages; }
     /// The region that holds `address`, else the first above it, else none. Costs a binary search.
     const AddressSpaceRegion* regionAtOrAbove(uint64_t address) const;
 
@@ -74,6 +77,7 @@ private:
     std::vector<AddressSpaceRegion> _regions;
     std::vector<LinuxImage> _images;
     uint64_t _partOfFamilyMemory = 0;
+    bool _missesPages = false;
 };
 
 /// Whether it maps a SysV segment, which only its path tells, never inode 0: its inode is the segment's id.

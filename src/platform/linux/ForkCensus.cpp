@@ -2,30 +2,31 @@
 
 void ForkCensus::begin() {
     const std::lock_guard lock(_mutex);
-    _programs.clear();
+    _execs.clear();
     _members.clear();
-    _hasSaved = false;
+    _anybodyCanBeMeasured = false;
 }
 
-void ForkCensus::add(int32_t pid, uint64_t program) {
+void ForkCensus::add(int32_t pid, uint64_t exec) {
     const std::lock_guard lock(_mutex);
-    if (_programs.emplace(pid, program).second) {
-        ++_members[program];
+    if (_execs.emplace(pid, exec).second) {
+        ++_members[exec];
     }
+    _anybodyCanBeMeasured |= exec == 0;
 }
 
 void ForkCensus::addSaved() {
     const std::lock_guard lock(_mutex);
-    _hasSaved = true;
+    _anybodyCanBeMeasured = true;
 }
 
 size_t ForkCensus::measured() const {
     const std::lock_guard lock(_mutex);
-    return _programs.size();
+    return _execs.size();
 }
 
 bool ForkCensus::isAlone(int32_t pid) const {
     const std::lock_guard lock(_mutex);
-    const auto found = _programs.find(pid);
-    return !_hasSaved && found != _programs.end() && found->second != 0 && _members.at(found->second) == 1;
+    const auto found = _execs.find(pid);
+    return !_anybodyCanBeMeasured && found != _execs.end() && _members.at(found->second) == 1;
 }

@@ -127,6 +127,7 @@ std::unique_ptr<LinuxTask> LinuxTask::open(LinuxRun& run, int32_t pid, ListedPro
         return nullptr;
     }
     task->_program = auxv.empty() ? 0 : run.identity.bytes(auxv);
+    task->_exec = randomBytesAddress(auxv).value_or(0);
     return task;
 }
 
@@ -240,9 +241,21 @@ ForkFamily& LinuxTask::_family() {
 }
 
 kern_return_t LinuxTask::takeSnapshot() {
-    if (_space) {
-        return KERN_SUCCESS;
+    // Where pages are missing the process may have ended since its mappings were read, or run another
+    // program, which reading them again tells.
+    for (const bool isLast : {false, true}) {
+        if (const kern_return_t code = _space ? KERN_SUCCESS : _takeSnapshotOnce(); code != KERN_SUCCESS) {
+            return code;
+        }
+        if (isLast || !_space->missesPages()) {
+            break;
+        }
+        dropSnapshot();
     }
+    return KERN_SUCCESS;
+}
+
+kern_return_t LinuxTask::_takeSnapshotOnce() {
     // Thousands of processes are looked at in turn: room for the mappings is made once for a thread.
     thread_local Mappings mappings;
     const kern_return_t code = _readMappings(mappings);
@@ -304,7 +317,7 @@ bool LinuxTask::sharesAnothersSpace() {
 }
 
 void LinuxTask::survey(bool withOwnedObjects) {
-    _run.forkCensus.add(_pid, _program);
+    _run.forkCensus.add(_pid, _exec);
     if (withOwnedObjects) {
         _surveyOwnedObjects();
     }

@@ -120,7 +120,6 @@ public:
 private:
     LinuxTask(LinuxRun& run, int32_t pid, ListedProcess listed);
 
-    /// The directory to read memory through: that of a thread that lives.
     /// False when no thread of the process lives.
     bool _chooseThread();
     void _surveyOwnedObjects();
@@ -135,6 +134,7 @@ private:
         /// Gives the room of very many mappings back, which few processes need.
         void forgetMany();
     };
+    kern_return_t _takeSnapshotOnce();
     kern_return_t _readMappings(Mappings& mappings);
     bool _readMappingsOnce(Mappings& mappings);
     bool _countsPayOff(const procfs::ProcStatus& status) const;
@@ -157,6 +157,7 @@ private:
     procfs::ProcStat _stat;      ///< of that thread, as last seen
     std::string _executable;
     uint64_t _program = 0;  ///< stands for its auxv, which each exec makes anew; 0 for none
+    uint64_t _exec = 0;     ///< see ForkCensus
     std::optional<procfs::ProcStatus> _status;
     uint64_t _statusTime = 0;                 ///< nanoseconds of CLOCK_MONOTONIC
     std::shared_ptr<ForkFamily> _forkFamily;  ///< held, so that its frames stay known while its members live

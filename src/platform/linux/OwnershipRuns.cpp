@@ -307,21 +307,21 @@ bool addWindows(RunMaker& maker, WindowReader& reader, const procfs::Vma& vma) {
 
 // Asking for zero pages costs a second walk of the page tables and most mappings have none. That there are
 // some shows by more pages being present than the mapping's count has.
-std::vector<OwnershipRun> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
-                                        FrameGenerations* generations) {
+std::optional<std::vector<OwnershipRun>> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
+                                                       FrameGenerations* generations) {
     constexpr uint64_t kLargestWithoutKnowingHoles = 64ULL << 30U;
     if (question.vma.size() > kLargestWithoutKnowingHoles && !pages.knowsHoles()) {
-        return {};
+        return std::vector<OwnershipRun>();
     }
     for (const bool withoutZeroPages : {false, true}) {
         RunMaker maker(question, generations);
         WindowReader reader(question, pages, withoutZeroPages);
         if (!addWindows(maker, reader, question.vma)) {
-            return {};
+            return std::nullopt;
         }
         if (withoutZeroPages || maker.resident() <= question.vma.resident() / question.pageSize) {
             return maker.finish();
         }
     }
-    return {};
+    return std::nullopt;
 }

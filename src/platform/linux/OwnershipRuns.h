@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <span>
 #include <vector>
 
@@ -69,9 +70,9 @@ bool needsOwnershipRuns(const OwnershipQuestion& question);
 /// The zero page counts as absent. Large stretches without a page are passed over without being read.
 ///
 /// The counts of the runs add up to those of the mapping (`rss`, `swap`), which was counted a moment earlier:
-/// what came or went in between is added to or taken from the largest runs. Empty when the pages cannot be
-/// read, are all gone, or lie in a mapping so large that it cannot be read without knowing its holes.
+/// what came or went in between is added to or taken from the largest runs. Empty when they are all gone, or
+/// lie in a mapping so large that it cannot be read without knowing its holes; none when they cannot be read.
 ///
 /// `generations` are those of the process's family, null when it is alone.
-std::vector<OwnershipRun> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
-                                        FrameGenerations* generations);
+std::optional<std::vector<OwnershipRun>> ownershipRuns(const OwnershipQuestion& question, PageSource& pages,
+                                                       FrameGenerations* generations);

@@ -50,9 +50,6 @@ protected:
     }
 
     bool isCounted(const Measured& measured) {
-        class GonePages : public WrittenPages {
-            bool readPages(uint64_t, std::span<PagemapEntry>) override { return false; }
-        };
         process.emplace(measured.mappings);
         std::filesystem::remove(place("20/smaps_rollup"));
         if (!measured.sums.empty()) {
@@ -61,16 +58,14 @@ protected:
         const procfs::Descriptor proc = directory("");
         const procfs::Descriptor memory = directory("20");
         UncountedPages uncounted(proc.get(), _top + "/pages_shared");
-        GonePages gone;
-        gone.pages = process->pages.pages;
+        process->pages.canBeRead = measured.canReadPages;
         const PageScanner noScan = [](const PageScan&, std::span<ScannedRange>, uint64_t&) { return -1; };
         const PageScanner scan = measured.canScan ? process->scanner() : noScan;
-        PageSource& pages = measured.canReadPages ? process->pages : static_cast<PageSource&>(gone);
         filePages = countWithoutSmaps(process->vmas,
                                       {.memoryDirectory = memory.get(),
                                        .status = measured.status,
                                        .scan = scan,
-                                       .pages = pages,
+                                       .pages = process->pages,
                                        .pageSize = ScannedProcess::kPage,
                                        .isAlone = !measured.hasFork},
                                       uncounted);

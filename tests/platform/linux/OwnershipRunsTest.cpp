@@ -31,7 +31,7 @@ public:
     }
 
     std::vector<OwnershipRun> runs(FrameGenerations& generations, bool isFileMapping = false) {
-        return ownershipRuns(
+        return *ownershipRuns(
             {.vma = vma, .isFileMapping = isFileMapping, .pageSize = kPage, .isAlone = false}, pages,
             &generations);
     }
@@ -120,8 +120,8 @@ TEST(OwnershipRuns, SparseMappingsAreReadOnlyWhereTheyHavePages) {
     pages.pages = sparse.pages.pages;
     FrameGenerations generations;
     const auto runs =
-        ownershipRuns({.vma = sparse.vma, .isFileMapping = false, .pageSize = kPage, .isAlone = false}, pages,
-                      &generations);
+        *ownershipRuns({.vma = sparse.vma, .isFileMapping = false, .pageSize = kPage, .isAlone = false},
+                       pages, &generations);
     EXPECT_EQ(describe(runs), "0+1024 family 1/0\n1024+203776 none 0/0\n204800+2 family 1/0\n");
     EXPECT_LT(pages.read, 20 * kWindowPages);
 }
